@@ -1,0 +1,18 @@
+#include "platform/Assert.h"
+
+#include <cstdarg>
+#include <cstdlib>
+
+#include "platform/Log.h"
+
+namespace lumivale {
+
+void assertInternal(const char* format, ...) {
+    va_list args;
+    va_start(args, format);
+    lv_vprintLog(7, "tessarine", format, args);
+    va_end(args);
+    std::abort();
+}
+
+}  // namespace lumivale

@@ -1,0 +1,18 @@
+# Shared by the build scripts: where builds go and how they are configured.
+# Sourced, not run.
+repo_root="$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)"
+build_root="${TESSARINE_BUILD_ROOT:-$repo_root/build}"
+
+# Compiler cache kept outside the checkout, so that a fresh clone on the same
+# machine (a CI rerun) reuses earlier compilations.
+export CCACHE_DIR="${CCACHE_DIR:-${XDG_CACHE_HOME:-$HOME/.cache}/tessarine/ccache}"
+export CCACHE_MAXSIZE="${CCACHE_MAXSIZE:-5G}"
+
+# configure_build NAME [cmake options...]: configures $build_root/NAME.
+configure_build() {
+  local name="$1"; shift
+  local launcher=()
+  command -v ccache >/dev/null && launcher=(-DCMAKE_CXX_COMPILER_LAUNCHER=ccache)
+  cmake -S "$repo_root" -B "$build_root/$name" -G Ninja -Wno-dev --log-level=WARNING \
+    "${launcher[@]}" "$@" >/dev/null
+}

@@ -1,0 +1,42 @@
+#include "sqlite/Connection.h"
+
+#include <sqlite3.h>
+
+#include "sqlite/SQLiteException.h"
+
+namespace lumivale {
+namespace sqlite {
+
+namespace {
+// The layer serialises every call itself, so SQLite's own per-connection
+// mutex would only be taken a second time; keep it unless the caller asked.
+int withThreadingMode(int flags) {
+    if (flags & SQLITE_OPEN_FULLMUTEX) return flags;
+    return flags | SQLITE_OPEN_NOMUTEX;
+}
+}  // namespace
+
+Connection::Connection(const std::string& path, int flags) {
+    int rc = sqlite3_open_v2(path.c_str(), &db, withThreadingMode(flags), nullptr);
+    if (rc != SQLITE_OK) {
+        std::string message = db ? sqlite3_errmsg(db) : sqlite3_errstr(rc);
+        sqlite3_close(db);
+        db = nullptr;
+        throw SQLiteException(rc, message, "opening database \"" + path + "\"");
+    }
+    sqlite3_extended_result_codes(db, 1);
+}
+
+Connection::~Connection() { sqlite3_close_v2(db); }
+
+void Connection::fail(int code, const std::string& context) const {
+    throw SQLiteException(code, sqlite3_errmsg(db), context);
+}
+
+void Connection::exec(const std::string& sql) {
+    int rc = sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr);
+    if (rc != SQLITE_OK) fail(rc, "executing: " + sql);
+}
+
+}  // namespace sqlite
+}  // namespace lumivale

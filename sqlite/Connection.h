@@ -1,0 +1,45 @@
+// Internal to the SQLite access layer: the one sqlite3 handle of a Database,
+// the recursive mutex that serialises every call on it, and the depth of the
+// transaction that the mutex's owner has open.
+//
+// Database and every Statement prepared from it share the Connection, so a
+// statement that outlives its Database (a cursor the application still holds)
+// keeps the handle and the mutex valid. Every member function except the
+// constructor expects the caller to hold mutex().
+#pragma once
+
+#include <mutex>
+#include <string>
+
+struct sqlite3;
+
+namespace lumivale {
+namespace sqlite {
+
+class Connection {
+public:
+    Connection(const std::string& path, int flags);
+    ~Connection();
+    Connection(const Connection&) = delete;
+    Connection& operator=(const Connection&) = delete;
+
+    sqlite3* handle() const { return db; }
+    std::recursive_mutex& mutex() { return lock; }
+
+    // Throws SQLiteException with the connection's current error message.
+    [[noreturn]] void fail(int code, const std::string& context) const;
+
+    // Runs SQL that may return rows (which are discarded); throws on error.
+    void exec(const std::string& sql);
+
+    // Transactions nest: depth 0 means autocommit. Owned by the thread that
+    // holds mutex() for the whole of the outermost transaction.
+    int transactionDepth = 0;
+
+private:
+    sqlite3* db = nullptr;
+    std::recursive_mutex lock;
+};
+
+}  // namespace sqlite
+}  // namespace lumivale

@@ -1,0 +1,64 @@
+// One SQLite connection, shared by every storage class of a store.
+//
+// Threads: every operation may be called from any thread. All calls on the
+// connection, including those of the Statements prepared from it, are
+// serialised by one recursive mutex. runInTransaction holds that mutex from
+// BEGIN to COMMIT, so a statement that another thread issues meanwhile waits
+// until the transaction has ended: it is neither rolled back with it nor
+// committed early. On the thread that owns the transaction, statements and
+// nested runInTransaction calls go straight through; a nested call is a
+// savepoint, so its failure undoes only its own writes.
+//
+// A function run inside runInTransaction must not wait for another thread
+// that uses this database: that thread cannot get in until the transaction
+// ends.
+//
+// Errors: every failure of SQLite throws SQLiteException.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "sqlite/Statement.h"
+
+namespace lumivale {
+namespace sqlite {
+
+class Connection;
+
+class Database {
+public:
+    // How a transaction takes its locks. The store always uses Immediate (2):
+    // it takes the write lock at BEGIN, so a transaction that has started can
+    // never fail half-way through on the upgrade from a read to a write lock
+    // (a deferred transaction can, and in WAL mode such a busy error is not
+    // even retried by the busy timeout). Exclusive would also keep readers of
+    // other connections out, which the store does not need.
+    enum class TransactionType { Deferred = 1, Immediate = 2, Exclusive = 3 };
+
+    // flags are sqlite3_open_v2's (the store passes read-write | create).
+    // "" and ":memory:" keep SQLite's meaning.
+    Database(const std::string& path, int flags);
+    ~Database();
+    Database(const Database&) = delete;
+    Database& operator=(const Database&) = delete;
+
+    // Runs one SQL statement to completion; rows it returns are discarded.
+    void exec(const std::string& sql);
+
+    // Compiles one statement with ? placeholders.
+    Statement prepare(const std::string& sql);
+
+    // Begins a transaction of the given type, runs fn and commits. If fn
+    // throws, everything fn wrote is rolled back and the exception continues
+    // unchanged. If the commit itself fails, the transaction is rolled back
+    // and SQLiteException is thrown.
+    void runInTransaction(const std::function<void()>& fn, TransactionType type);
+
+private:
+    std::shared_ptr<Connection> connection;
+};
+
+}  // namespace sqlite
+}  // namespace lumivale

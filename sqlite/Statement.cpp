@@ -1,0 +1,142 @@
+#include "sqlite/Statement.h"
+
+#include <sqlite3.h>
+
+#include "sqlite/Connection.h"
+#include "sqlite/SQLiteException.h"
+
+namespace lumivale {
+namespace sqlite {
+
+namespace {
+using Lock = std::lock_guard<std::recursive_mutex>;
+}
+
+Statement::Statement(std::shared_ptr<Connection> connection, sqlite3_stmt* statement)
+    : connection(std::move(connection)), statement(statement) {}
+
+Statement::Statement(Statement&& other) noexcept
+    : connection(std::move(other.connection)), statement(other.statement), finished(other.finished) {
+    other.statement = nullptr;
+}
+
+Statement& Statement::operator=(Statement&& other) noexcept {
+    if (this != &other) {
+        finalize();
+        connection = std::move(other.connection);
+        statement = other.statement;
+        finished = other.finished;
+        other.statement = nullptr;
+    }
+    return *this;
+}
+
+Statement::~Statement() { finalize(); }
+
+void Statement::finalize() noexcept {
+    if (statement == nullptr) return;
+    Lock lock(connection->mutex());
+    sqlite3_finalize(statement);
+    statement = nullptr;
+}
+
+sqlite3_stmt* Statement::checkedHandle(const char* action) const {
+    if (statement == nullptr) {
+        throw SQLiteException(SQLITE_MISUSE, "statement has been moved from", action);
+    }
+    return statement;
+}
+
+void Statement::fail(int code, const char* action) const {
+    const char* sql = sqlite3_sql(statement);
+    connection->fail(code, std::string(action) + ": " + (sql ? sql : ""));
+}
+
+void Statement::bind(int index, int value) {
+    sqlite3_stmt* s = checkedHandle("binding");
+    Lock lock(connection->mutex());
+    int rc = sqlite3_bind_int(s, index, value);
+    if (rc != SQLITE_OK) fail(rc, "binding");
+}
+
+void Statement::bind(int index, long long value) {
+    sqlite3_stmt* s = checkedHandle("binding");
+    Lock lock(connection->mutex());
+    int rc = sqlite3_bind_int64(s, index, static_cast<sqlite3_int64>(value));
+    if (rc != SQLITE_OK) fail(rc, "binding");
+}
+
+void Statement::bind(int index, const std::string& value) {
+    sqlite3_stmt* s = checkedHandle("binding");
+    Lock lock(connection->mutex());
+    int rc = sqlite3_bind_text64(s, index, value.data(), value.size(), SQLITE_TRANSIENT, SQLITE_UTF8);
+    if (rc != SQLITE_OK) fail(rc, "binding");
+}
+
+void Statement::bindBlob(int index, const unsigned char* data, unsigned int size) {
+    sqlite3_stmt* s = checkedHandle("binding");
+    if (data == nullptr && size != 0) {
+        throw SQLiteException(SQLITE_MISUSE, "blob of " + std::to_string(size) + " bytes without data",
+                              "binding");
+    }
+    Lock lock(connection->mutex());
+    // sqlite3_bind_blob turns a null pointer into NULL; an empty payload is
+    // stored as an empty blob instead.
+    int rc = size == 0 ? sqlite3_bind_zeroblob(s, index, 0)
+                       : sqlite3_bind_blob64(s, index, data, size, SQLITE_TRANSIENT);
+    if (rc != SQLITE_OK) fail(rc, "binding");
+}
+
+bool Statement::step() {
+    sqlite3_stmt* s = checkedHandle("stepping");
+    // SQLite would silently restart a finished statement; a reader that steps
+    // past the end must keep seeing the end instead.
+    if (finished) return false;
+    Lock lock(connection->mutex());
+    int rc = sqlite3_step(s);
+    if (rc == SQLITE_ROW) return true;
+    if (rc == SQLITE_DONE) {
+        finished = true;
+        return false;
+    }
+    fail(rc, "stepping");
+}
+
+void Statement::reset() {
+    sqlite3_stmt* s = checkedHandle("resetting");
+    Lock lock(connection->mutex());
+    // The result repeats the last step's error, which step already reported.
+    sqlite3_reset(s);
+    finished = false;
+}
+
+int Statement::Column::getInt() const {
+    sqlite3_stmt* s = statement.checkedHandle("reading a column");
+    Lock lock(statement.connection->mutex());
+    return sqlite3_column_int(s, index);
+}
+
+long long Statement::Column::getInt64() const {
+    sqlite3_stmt* s = statement.checkedHandle("reading a column");
+    Lock lock(statement.connection->mutex());
+    return sqlite3_column_int64(s, index);
+}
+
+std::string Statement::Column::getText() const {
+    sqlite3_stmt* s = statement.checkedHandle("reading a column");
+    Lock lock(statement.connection->mutex());
+    const unsigned char* text = sqlite3_column_text(s, index);
+    if (text == nullptr) return std::string();
+    return std::string(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(s, index)));
+}
+
+std::pair<const unsigned char*, std::size_t> Statement::Column::getBlobDirectBuffer() const {
+    sqlite3_stmt* s = statement.checkedHandle("reading a column");
+    Lock lock(statement.connection->mutex());
+    const void* blob = sqlite3_column_blob(s, index);
+    std::size_t size = static_cast<std::size_t>(sqlite3_column_bytes(s, index));
+    return {static_cast<const unsigned char*>(blob), blob == nullptr ? 0 : size};
+}
+
+}  // namespace sqlite
+}  // namespace lumivale

@@ -1,0 +1,82 @@
+// A prepared statement of a Database, and the column handle that reads its
+// current row.
+//
+// Movable, not copyable; the destructor finalises the statement, and a
+// moved-from Statement owns nothing and finalises nothing. Parameter indexes
+// start at 1, column indexes at 0, as in SQLite.
+//
+// Threads: every call takes the connection's mutex, so statements of one
+// Database may be used from several threads (one thread per statement at a
+// time). A statement keeps its connection open even after the Database
+// object that prepared it is gone.
+//
+// Errors: SQLite failures throw SQLiteException; so does using a moved-from
+// statement.
+#pragma once
+
+#include <cstddef>
+#include <memory>
+#include <string>
+#include <utility>
+
+struct sqlite3_stmt;
+
+namespace lumivale {
+namespace sqlite {
+
+class Connection;
+
+class Statement {
+public:
+    // Names one column of the current row; valid only while that row is.
+    class Column {
+    public:
+        int getInt() const;
+        long long getInt64() const;
+        std::string getText() const;  // empty for NULL; may hold zero bytes
+        // The bytes in place, valid until the statement is stepped, reset or
+        // destroyed. NULL and zero-length values give a count of 0.
+        std::pair<const unsigned char*, std::size_t> getBlobDirectBuffer() const;
+
+    private:
+        friend class Statement;
+        Column(const Statement& statement, int index) : statement(statement), index(index) {}
+        const Statement& statement;
+        int index;
+    };
+
+    Statement(Statement&& other) noexcept;
+    Statement& operator=(Statement&& other) noexcept;
+    ~Statement();
+    Statement(const Statement&) = delete;
+    Statement& operator=(const Statement&) = delete;
+
+    void bind(int index, int value);
+    void bind(int index, long long value);
+    void bind(int index, const std::string& value);  // TEXT, copied at bind time
+    // A BLOB of size bytes, copied at bind time. (nullptr, 0) binds an empty
+    // blob, not NULL.
+    void bindBlob(int index, const unsigned char* data, unsigned int size);
+
+    // True when a row is current; false once the statement has run to its
+    // end, and on every further call until reset().
+    bool step();
+    void reset();
+
+    Column operator()(int column) const { return Column(*this, column); }
+
+private:
+    friend class Database;
+    Statement(std::shared_ptr<Connection> connection, sqlite3_stmt* statement);
+
+    sqlite3_stmt* checkedHandle(const char* action) const;
+    [[noreturn]] void fail(int code, const char* action) const;
+    void finalize() noexcept;
+
+    std::shared_ptr<Connection> connection;
+    sqlite3_stmt* statement = nullptr;
+    bool finished = false;
+};
+
+}  // namespace sqlite
+}  // namespace lumivale

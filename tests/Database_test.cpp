@@ -1,0 +1,258 @@
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <condition_variable>
+#include <mutex>
+#include <stdexcept>
+#include <thread>
+#include <vector>
+
+#include "TestSupport.h"
+#include "sqlite/Database.h"
+#include "sqlite/SQLiteException.h"
+
+using lumivale::sqlite::Database;
+using lumivale::sqlite::SQLiteException;
+using lumivale::sqlite::Statement;
+
+namespace {
+
+constexpr auto kImmediate = Database::TransactionType::Immediate;
+
+class DatabaseTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        db = std::make_shared<Database>(dir.file("db.sqlite"), 6);
+        db->exec("PRAGMA journal_mode=WAL");
+        db->exec("CREATE TABLE t (k TEXT PRIMARY KEY, v BLOB)");
+    }
+
+    void insert(const std::string& key) {
+        Statement s = db->prepare("INSERT INTO t (k) VALUES (?)");
+        s.bind(1, key);
+        s.step();
+    }
+
+    long long count() {
+        Statement s = db->prepare("SELECT COUNT(*) FROM t");
+        s.step();
+        return s(0).getInt64();
+    }
+
+    bool has(const std::string& key) {
+        Statement s = db->prepare("SELECT 1 FROM t WHERE k = ?");
+        s.bind(1, key);
+        return s.step();
+    }
+
+    testsupport::TempDir dir;
+    std::shared_ptr<Database> db;
+};
+
+TEST_F(DatabaseTest, ThrowInsideTransactionLeavesNoTraceAndRethrowsSameException) {
+    try {
+        db->runInTransaction([&] {
+            insert("a");
+            insert("b");
+            throw std::logic_error("boom");
+        }, kImmediate);
+        FAIL() << "exception swallowed";
+    } catch (const std::logic_error& e) {
+        EXPECT_STREQ("boom", e.what());
+    }
+    EXPECT_EQ(0, count());
+    db->runInTransaction([&] { insert("c"); }, kImmediate);
+    EXPECT_EQ(1, count());
+}
+
+TEST_F(DatabaseTest, NestedTransactionsOnOneThreadCommitTogetherAndInnerFailureUndoesOnlyInner) {
+    db->runInTransaction([&] {
+        insert("outer");
+        db->runInTransaction([&] { insert("inner-kept"); }, kImmediate);
+        EXPECT_THROW(db->runInTransaction([&] {
+            insert("inner-lost");
+            db->runInTransaction([&] { insert("innermost-lost"); }, kImmediate);
+            throw std::runtime_error("inner");
+        }, kImmediate), std::runtime_error);
+        insert("after");
+    }, kImmediate);
+    EXPECT_TRUE(has("outer"));
+    EXPECT_TRUE(has("inner-kept"));
+    EXPECT_FALSE(has("inner-lost"));
+    EXPECT_FALSE(has("innermost-lost"));
+    EXPECT_TRUE(has("after"));
+
+    EXPECT_THROW(db->runInTransaction([&] {
+        db->runInTransaction([&] { insert("nested-in-failed"); }, kImmediate);
+        throw std::runtime_error("outer");
+    }, kImmediate), std::runtime_error);
+    EXPECT_FALSE(has("nested-in-failed"));
+}
+
+// The other thread's insert must neither be rolled back with the transaction
+// nor be visible (committed) while the transaction is still open.
+TEST_F(DatabaseTest, OtherThreadStatementWaitsForTransactionAndSurvivesItsRollback) {
+    std::mutex m;
+    std::condition_variable cv;
+    bool otherReady = false;
+    std::atomic<bool> otherDone{false};
+    std::thread other;
+
+    EXPECT_THROW(db->runInTransaction([&] {
+        insert("mine");
+        other = std::thread([&] {
+            {
+                std::lock_guard<std::mutex> lock(m);
+                otherReady = true;
+            }
+            cv.notify_one();
+            insert("theirs");
+            otherDone = true;
+        });
+        std::unique_lock<std::mutex> lock(m);
+        cv.wait(lock, [&] { return otherReady; });
+        lock.unlock();
+        // Give the other thread every chance to run its statement now.
+        for (int i = 0; i < 300; ++i) insert("filler" + std::to_string(i));
+        EXPECT_FALSE(has("theirs"));
+        EXPECT_FALSE(otherDone.load());
+        throw std::runtime_error("rollback");
+    }, kImmediate), std::runtime_error);
+
+    other.join();
+    EXPECT_TRUE(has("theirs"));
+    EXPECT_FALSE(has("mine"));
+    EXPECT_EQ(1, count());
+}
+
+TEST_F(DatabaseTest, ConcurrentTransactionsAndOpenReadersAcrossThreadsStayConsistent) {
+    for (int i = 0; i < 50; ++i) insert("seed" + std::to_string(i));
+    constexpr int kThreads = 4;
+    constexpr int kRounds = 100;
+    std::vector<std::thread> threads;
+    std::atomic<int> readerRows{0};
+    for (int t = 0; t < kThreads; ++t) {
+        threads.emplace_back([&, t] {
+            for (int r = 0; r < kRounds; ++r) {
+                db->runInTransaction([&] {
+                    insert("t" + std::to_string(t) + "-" + std::to_string(r));
+                    if (r % 10 == 0) {
+                        db->runInTransaction([&] { insert("n" + std::to_string(t) + "-" + std::to_string(r)); },
+                                             kImmediate);
+                    }
+                }, kImmediate);
+            }
+        });
+    }
+    // A reader that keeps a statement open across the writers' commits, the
+    // way an application holds a cursor.
+    threads.emplace_back([&] {
+        Statement s = db->prepare("SELECT k FROM t WHERE k LIKE 'seed%' ORDER BY k");
+        while (s.step()) {
+            EXPECT_FALSE(s(0).getText().empty());
+            ++readerRows;
+        }
+    });
+    for (auto& thread : threads) thread.join();
+    EXPECT_EQ(50, readerRows.load());
+    EXPECT_EQ(50 + kThreads * kRounds + kThreads * (kRounds / 10), count());
+}
+
+TEST_F(DatabaseTest, StatementBindingsBlobsAndEndOfRows) {
+    Statement insertBlob = db->prepare("INSERT INTO t (k, v) VALUES (?, ?)");
+    insertBlob.bind(1, std::string("empty"));
+    insertBlob.bindBlob(2, nullptr, 0);
+    EXPECT_FALSE(insertBlob.step());
+    insertBlob.reset();
+    const unsigned char bytes[] = {1, 0, 2};
+    insertBlob.bind(1, std::string("bytes"));
+    insertBlob.bindBlob(2, bytes, 3);
+    insertBlob.step();
+    insertBlob.reset();
+    insertBlob.bind(1, std::string("nul\0inside", 10));
+    insertBlob.bindBlob(2, bytes, 1);
+    insertBlob.step();
+    EXPECT_EQ(3, count());
+
+    Statement read = db->prepare("SELECT v, typeof(v) FROM t WHERE k = ?");
+    read.bind(1, std::string("empty"));
+    ASSERT_TRUE(read.step());
+    EXPECT_EQ(0u, read(0).getBlobDirectBuffer().second);
+    EXPECT_EQ("blob", read(1).getText());  // an empty blob, not NULL
+    read.reset();
+    read.bind(1, std::string("bytes"));
+    ASSERT_TRUE(read.step());
+    auto blob = read(0).getBlobDirectBuffer();
+    EXPECT_EQ(std::vector<unsigned char>(bytes, bytes + 3), std::vector<unsigned char>(blob.first, blob.first + blob.second));
+
+    Statement keys = db->prepare("SELECT k FROM t WHERE k LIKE 'nul%'");
+    ASSERT_TRUE(keys.step());
+    EXPECT_EQ(std::string("nul\0inside", 10), keys(0).getText());
+    EXPECT_FALSE(keys.step());
+    EXPECT_FALSE(keys.step());  // stays at the end instead of starting over
+    keys.reset();
+    EXPECT_TRUE(keys.step());
+
+    Statement numbers = db->prepare("SELECT ?, ?, NULL");
+    numbers.bind(1, 7);
+    numbers.bind(2, 9000000000LL);
+    ASSERT_TRUE(numbers.step());
+    EXPECT_EQ(7, numbers(0).getInt());
+    EXPECT_EQ(9000000000LL, numbers(1).getInt64());
+    EXPECT_EQ("", numbers(2).getText());
+    EXPECT_EQ(0u, numbers(2).getBlobDirectBuffer().second);
+
+    EXPECT_THROW(insertBlob.bindBlob(2, nullptr, 5), SQLiteException);
+}
+
+TEST_F(DatabaseTest, MovedFromStatementIsHarmless) {
+    Statement original = db->prepare("INSERT INTO t (k) VALUES ('moved')");
+    Statement target(std::move(original));
+    EXPECT_THROW(original.step(), SQLiteException);
+    {
+        Statement destroyedEmpty(std::move(original));
+    }
+    target.step();
+    EXPECT_TRUE(has("moved"));
+
+    Statement assigned = db->prepare("SELECT 1");
+    assigned = db->prepare("SELECT 2");
+    ASSERT_TRUE(assigned.step());
+    EXPECT_EQ(2, assigned(0).getInt());
+}
+
+TEST_F(DatabaseTest, StatementOutlivesItsDatabaseObject) {
+    insert("kept");
+    Statement s = db->prepare("SELECT k FROM t");
+    db.reset();
+    ASSERT_TRUE(s.step());
+    EXPECT_EQ("kept", s(0).getText());
+}
+
+TEST_F(DatabaseTest, ErrorsCarrySqliteMessageAndStatement) {
+    try {
+        db->prepare("SELEC k FROM t");
+        FAIL();
+    } catch (const SQLiteException& e) {
+        EXPECT_NE(std::string::npos, std::string(e.what()).find("syntax error")) << e.what();
+        EXPECT_NE(std::string::npos, std::string(e.what()).find("SELEC k FROM t")) << e.what();
+    }
+    insert("dup");
+    try {
+        insert("dup");
+        FAIL();
+    } catch (const SQLiteException& e) {
+        EXPECT_NE(std::string::npos, std::string(e.what()).find("UNIQUE constraint failed")) << e.what();
+        EXPECT_NE(std::string::npos, std::string(e.what()).find("INSERT INTO t")) << e.what();
+    }
+    EXPECT_THROW(db->exec("DROP TABLE missing"), SQLiteException);
+    EXPECT_THROW(Database(dir.file("no/such/dir/db.sqlite"), 6), SQLiteException);
+    // A failed statement inside a transaction rolls back the whole of it.
+    EXPECT_THROW(db->runInTransaction([&] {
+        insert("new");
+        insert("dup");
+    }, kImmediate), SQLiteException);
+    EXPECT_FALSE(has("new"));
+}
+
+}  // namespace

@@ -1,0 +1,57 @@
+#include "TestSupport.h"
+
+#include <atomic>
+#include <random>
+#include <thread>
+#include <unistd.h>
+
+namespace testsupport {
+
+TempDir::TempDir() {
+    static std::atomic<unsigned> counter{0};
+    std::random_device random;
+    dir = std::filesystem::temp_directory_path() /
+          ("tessarine-test-" + std::to_string(::getpid()) + "-" + std::to_string(counter++) + "-" +
+           std::to_string(random()));
+    std::filesystem::create_directories(dir);
+}
+
+TempDir::~TempDir() {
+    std::error_code ignored;
+    std::filesystem::permissions(dir, std::filesystem::perms::owner_all, std::filesystem::perm_options::add,
+                                 ignored);
+    std::filesystem::remove_all(dir, ignored);
+}
+
+LogCapture::LogCapture() {
+    lumivale::setLogSink([this](int priority, const std::string& tag, const std::string& message) {
+        std::lock_guard<std::mutex> lock(mutex);
+        captured.push_back({priority, tag, message});
+    });
+}
+
+LogCapture::~LogCapture() { lumivale::setLogSink(nullptr); }
+
+std::vector<LogLine> LogCapture::lines() const {
+    std::lock_guard<std::mutex> lock(mutex);
+    return captured;
+}
+
+std::vector<LogLine> LogCapture::linesStartingWith(const std::string& prefix) const {
+    std::vector<LogLine> result;
+    for (const LogLine& line : lines()) {
+        if (line.message.compare(0, prefix.size(), prefix) == 0) result.push_back(line);
+    }
+    return result;
+}
+
+bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds deadline) {
+    auto end = std::chrono::steady_clock::now() + deadline;
+    while (!condition()) {
+        if (std::chrono::steady_clock::now() >= end) return condition();
+        std::this_thread::sleep_for(std::chrono::milliseconds(1));
+    }
+    return true;
+}
+
+}  // namespace testsupport

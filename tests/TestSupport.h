@@ -1,0 +1,60 @@
+// Helpers shared by the tests: a temporary directory, a log capture and a
+// deadline-bounded wait.
+#pragma once
+
+#include <chrono>
+#include <condition_variable>
+#include <filesystem>
+#include <functional>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/Log.h"
+
+namespace testsupport {
+
+// A fresh directory under the system's temporary folder, removed with its
+// contents when the object goes.
+class TempDir {
+public:
+    TempDir();
+    ~TempDir();
+    TempDir(const TempDir&) = delete;
+    TempDir& operator=(const TempDir&) = delete;
+
+    const std::filesystem::path& path() const { return dir; }
+    std::string file(const std::string& name) const { return (dir / name).string(); }
+
+private:
+    std::filesystem::path dir;
+};
+
+struct LogLine {
+    int priority;
+    std::string tag;
+    std::string message;
+};
+
+// Routes the library's log to memory while it lives; thread-safe.
+class LogCapture {
+public:
+    LogCapture();
+    ~LogCapture();
+
+    std::vector<LogLine> lines() const;
+    // Lines whose message starts with prefix.
+    std::vector<LogLine> linesStartingWith(const std::string& prefix) const;
+
+private:
+    mutable std::mutex mutex;
+    std::vector<LogLine> captured;
+};
+
+// Waits until condition() holds or the deadline passes; returns the last
+// value of condition(). Polls, so it needs no cooperation from the code under
+// test, and returns as soon as the condition holds.
+bool waitUntil(const std::function<bool()>& condition,
+               std::chrono::milliseconds deadline = std::chrono::seconds(20));
+
+}  // namespace testsupport
