@@ -1,0 +1,62 @@
+#include "tessarine/Cursor.h"
+
+#include "platform/Assert.h"
+#include "platform/Log.h"
+#include "sqlite/SQLiteException.h"
+
+namespace lumivale {
+namespace tessarine {
+
+Cursor::Cursor(lumivale::sqlite::Statement&& statement, int primaryKeyColumn, int sortKeyColumn, int blobColumn,
+               int statusColumn) noexcept
+    : statement(std::move(statement)),
+      primaryKeyColumn(primaryKeyColumn),
+      sortKeyColumn(sortKeyColumn),
+      blobColumn(blobColumn),
+      statusColumn(statusColumn) {}
+
+bool Cursor::step() noexcept {
+    if (!statement) return false;
+    try {
+        hasCurrentRow = statement->step();
+    } catch (const lumivale::sqlite::SQLiteException& e) {
+        hasCurrentRow = false;
+        lv_printLog(5, "tessarine", "Cursor::step failed: %s", e.what());
+    }
+    return hasCurrentRow;
+}
+
+void Cursor::close() noexcept {
+    hasCurrentRow = false;
+    statement.reset();
+}
+
+void Cursor::checkCurrentRow() const noexcept {
+    if (!hasCurrentRow) {
+        lumivale::assertInternal("Assert (%s:%d): There's no current row. Did you forget to call step()?", "Cursor",
+                                 __LINE__);
+    }
+}
+
+std::string Cursor::getPrimaryKey() const noexcept {
+    checkCurrentRow();
+    return (*statement)(primaryKeyColumn).getText();
+}
+
+std::string Cursor::getSortKey() const noexcept {
+    checkCurrentRow();
+    return (*statement)(sortKeyColumn).getText();
+}
+
+std::pair<const unsigned char*, std::size_t> Cursor::getBlob() const noexcept {
+    checkCurrentRow();
+    return (*statement)(blobColumn).getBlobDirectBuffer();
+}
+
+int Cursor::getStatus() const noexcept {
+    checkCurrentRow();
+    return (*statement)(statusColumn).getInt();
+}
+
+}  // namespace tessarine
+}  // namespace lumivale
