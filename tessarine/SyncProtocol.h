@@ -1,6 +1,31 @@
 // The transport between a store and its server, implemented by the
 // application, and the records that cross it.
 //
+// The application derives from SyncProtocol, implements the four pure
+// operations on its own messaging connection, and reports what the
+// connection delivers by calling the on... entry points. Each entry point
+// hands the event to the callbacks that the store's components registered,
+// in registration order.
+//
+// Registries: one per kind of event, five in all. Every add returns an id
+// that is unique within its registry, counting from 1 and never reused; once
+// INT_MAX ids have been handed out, further adds throw std::runtime_error.
+// Removing an id that is not registered changes nothing. An entry point
+// calls the registered callbacks one after another and passes its argument
+// unchanged; a callback that throws (an empty one throws
+// std::bad_function_call) ends the delivery: the later callbacks are not
+// called and the exception reaches the caller of the entry point.
+//
+// Threads: every operation may be called from any thread. Each registry has a
+// list lock, held for a whole delivery, and an id lock taken inside it. So
+// two events of one kind never run their callbacks at the same time, events
+// of different kinds can, and adding or removing blocks while that registry
+// delivers. A callback must not add to, remove from or deliver into the
+// registry that is delivering to it (the locks are not recursive); it may
+// deliver into another registry, as long as no other thread delivers in the
+// opposite direction. The store itself only goes from a snapshot delivery to
+// the delta-status and delta-received registries.
+//
 // The records are plain values: default-constructible with empty strings and
 // vectors, copied member by member into jobs, queues and callback arguments.
 // Strings are byte strings; blobs are counted byte vectors; 64-bit numbers are
@@ -9,7 +34,10 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
+#include <mutex>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace lumivale {
@@ -86,6 +114,80 @@ public:
         PayloadType type = PayloadType::DELTA_LIST;
         std::vector<unsigned char> data;
     };
+
+    using ConnectionEstablishedCallback = std::function<void()>;
+    using SubscriptionResponseReceivedCallback = std::function<void(const SubscriptionResponse&)>;
+    using DeltaReceivedCallback = std::function<void(const std::vector<Delta>&)>;
+    using DeltaStatusUpdatedCallback = std::function<void(const DeltaStatusUpdate&)>;
+    using SnapshotReceivedCallback = std::function<void(const Snapshot&)>;
+
+    SyncProtocol() = default;
+    SyncProtocol(const SyncProtocol&) = delete;
+    SyncProtocol& operator=(const SyncProtocol&) = delete;
+    // Destroys the registries without calling any callback.
+    virtual ~SyncProtocol() = 0;
+
+    // Begins connecting; from then on the implementation calls
+    // onConnectionEstablished() each time a connection is up.
+    virtual void start() = 0;
+    // Publishes a subscription for request.collectionName.
+    virtual void sendSubscriptionRequest(const SubscriptionRequest& request) = 0;
+    // Publishes one local change, whose clientId is this store's. The result
+    // is handed back to the store's caller unread.
+    virtual int sendDelta(const Delta& delta) = 0;
+    // Asks the server for a snapshot of a collection for a client; the store
+    // itself never calls it.
+    virtual void sendSnapshotRequest(const std::string& collectionName, const std::string& clientId) = 0;
+
+    // For the store's own injected events: each calls the matching on...
+    // operation virtually, so an override sees injected events too.
+    virtual void triggerDeltaReceivedCallbacks(const std::vector<Delta>& deltas);
+    virtual void triggerDeltaStatusUpdatedCallbacks(const DeltaStatusUpdate& update);
+
+    // Entry points for the implementation: each delivers its event to the
+    // callbacks of its registry.
+    virtual void onConnectionEstablished();
+    virtual void onSubscriptionResponseReceived(const SubscriptionResponse& response);
+    virtual void onDeltaReceived(const std::vector<Delta>& deltas);
+    virtual void onDeltaStatusUpdated(const DeltaStatusUpdate& update);
+    virtual void onSnapshotReceived(const Snapshot& snapshot);
+
+    int addConnectionEstablishedCallback(const ConnectionEstablishedCallback& callback);
+    void removeConnectionEstablishedCallback(int id);
+    int addSubscriptionResponseReceivedCallback(const SubscriptionResponseReceivedCallback& callback);
+    void removeSubscriptionResponseReceivedCallback(int id);
+    int addDeltaReceivedCallback(const DeltaReceivedCallback& callback);
+    void removeDeltaReceivedCallback(int id);
+    int addDeltaStatusUpdatedCallback(const DeltaStatusUpdatedCallback& callback);
+    void removeDeltaStatusUpdatedCallback(int id);
+    int addSnapshotReceivedCallback(const SnapshotReceivedCallback& callback);
+    void removeSnapshotReceivedCallback(int id);
+
+private:
+    // The callbacks of one kind of event with their ids. Lock order:
+    // listMutex, then idMutex. Its operations are defined in SyncProtocol.cpp,
+    // the only place that uses them.
+    template <typename... Args>
+    class CallbackRegistry {
+    public:
+        using Callback = std::function<void(Args...)>;
+
+        int add(const Callback& callback);
+        void remove(int id);
+        void deliver(Args... args);
+
+    private:
+        std::vector<std::pair<int, Callback>> entries;
+        int lastId = 0;
+        std::mutex listMutex;
+        std::mutex idMutex;
+    };
+
+    CallbackRegistry<> connectionEstablishedCallbacks;
+    CallbackRegistry<const SubscriptionResponse&> subscriptionResponseReceivedCallbacks;
+    CallbackRegistry<const std::vector<Delta>&> deltaReceivedCallbacks;
+    CallbackRegistry<const DeltaStatusUpdate&> deltaStatusUpdatedCallbacks;
+    CallbackRegistry<const Snapshot&> snapshotReceivedCallbacks;
 };
 
 }  // namespace tessarine

@@ -1,0 +1,116 @@
+#include "tessarine/SerializedJobQueue.h"
+
+#include <exception>
+#include <stdexcept>
+#include <utility>
+
+#include "platform/Log.h"
+
+namespace lumivale {
+namespace tessarine {
+
+namespace {
+
+// How long the idle worker waits for work before it looks at the stop flag
+// again (2^32 - 1 ms, about 49.7 days); a stop also wakes it through the
+// no-op job that the destructor posts.
+constexpr std::chrono::milliseconds kIdleWait(4294967295LL);
+
+}  // namespace
+
+SerializedJobQueue::SerializedJobQueue(std::shared_ptr<ThreadCreator> threadCreator,
+                                       ExponentialBackoff<std::chrono::milliseconds> backoff)
+    : jobs(-1), threadCreator(std::move(threadCreator)), backoff(backoff) {
+    if (!this->threadCreator) throw std::runtime_error("SerializedJobQueue needs a ThreadCreator");
+    if (!this->backoff.isValid()) throw std::runtime_error("SerializedJobQueue: invalid back-off");
+    std::thread thread = this->threadCreator->createThread([this] { mainLoop(); });
+    if (!thread.joinable()) {
+        throw std::runtime_error("ThreadCreator::createThread returned a thread that is not joinable");
+    }
+    worker = std::move(thread);
+}
+
+SerializedJobQueue::~SerializedJobQueue() {
+    stopProcessingJobs();
+    // Wakes a worker that waits for work; stopProcessingJobs has already woken
+    // one that pauses between attempts.
+    jobs.queue(Job{[] {}}, false);
+    if (worker.joinable()) worker.join();
+}
+
+void SerializedJobQueue::stopProcessingJobs() {
+    {
+        // Under sleepMutex, so that a worker about to pause either sees the
+        // flag already cleared or is already waiting when the notice comes.
+        std::lock_guard<std::mutex> sleepLock(sleepMutex);
+        running = false;
+    }
+    sleepCondition.notify_all();
+    // The worker checks the flag under jobMutex before every attempt, so
+    // once the flag is clear no attempt starts; taking the mutex waits for
+    // the one that may be running.
+    std::lock_guard<std::mutex> jobLock(jobMutex);
+}
+
+void SerializedJobQueue::addJob(Job job) {
+    if (!job.run) throw std::runtime_error("SerializedJobQueue: a job needs a function");
+    jobs.queue(job, false);
+}
+
+void SerializedJobQueue::mainLoop() {
+    while (running) {
+        {
+            auto lock = jobs.lock();
+            jobs.waitUntilNotEmpty(lock, std::chrono::system_clock::now() + kIdleWait);
+        }
+        consumeQueue();
+    }
+}
+
+void SerializedJobQueue::consumeQueue() {
+    while (running) {
+        Job job;
+        {
+            auto lock = jobs.lock();
+            if (!jobs.isNotEmptyNoLock()) return;
+            // The job stays at the front while it runs.
+            job = jobs.frontNoLock();
+        }
+        retryUntilSucceeds(job);
+        auto lock = jobs.lock();
+        if (jobs.isNotEmptyNoLock()) jobs.popFrontNoLock();
+    }
+}
+
+void SerializedJobQueue::retryUntilSucceeds(const Job& job) {
+    backoff.reset();
+    while (true) {
+        {
+            std::lock_guard<std::mutex> jobLock(jobMutex);
+            if (!running) return;  // the job is abandoned
+            if (attempt(job)) return;
+        }
+        interruptableSleep(backoff.nextPause());
+    }
+}
+
+bool SerializedJobQueue::attempt(const Job& job) {
+    try {
+        job.run();
+        return true;
+    } catch (const std::exception&) {
+        return false;  // the job has logged what went wrong
+    } catch (...) {
+        lv_printLog(6, "tessarine", "Job failed with an exception not derived from std::exception; retrying");
+        return false;
+    }
+}
+
+void SerializedJobQueue::interruptableSleep(std::chrono::milliseconds delay) {
+    auto deadline = std::chrono::system_clock::now() + delay;
+    std::unique_lock<std::mutex> lock(sleepMutex);
+    sleepCondition.wait_until(lock, deadline, [this] { return !running; });
+}
+
+}  // namespace tessarine
+}  // namespace lumivale

@@ -1,0 +1,95 @@
+// The store's one background worker and the queue of jobs in front of it.
+//
+// Jobs run one at a time, in the order in which they were posted, on a
+// single thread made through the application's ThreadCreator. A job reports
+// failure by throwing; it is then run again after a pause from the back-off
+// record (every job starts its pauses afresh) until it succeeds or the queue
+// is stopped, and only then does the next job start. Failures are not logged:
+// the work in a job logs its own. An exception that does not derive from
+// std::exception is outside a job's contract; it is logged at priority 6 and
+// then treated like any other failure, so the job is retried and the worker
+// lives on.
+//
+// Stopping is final: once stopProcessingJobs has been called no attempt
+// starts (the call returns when an attempt in progress has ended), a worker
+// pausing between attempts wakes at once and abandons its job, and jobs
+// still queued, or posted later, never run. Jobs are not persisted.
+//
+// Threads: any thread may post jobs, a running job included (a follow-up job
+// runs after it). stopProcessingJobs waits until a running attempt has
+// finished. A job must not call stopProcessingJobs or destroy its queue: the
+// first waits for the attempt that makes the call, the second would join the
+// worker from the worker itself.
+//
+// Locks: the queue's own mutex guards the items and is never held while a
+// job runs; jobMutex is held for each attempt and by stopProcessingJobs to
+// wait for one; sleepMutex pairs the worker's pause with the wake-up of a
+// stop. No two of the three are ever held together.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <thread>
+
+#include "concurrency/SharedQueue.h"
+#include "tessarine/ExponentialBackoff.h"
+#include "tessarine/ThreadCreator.h"
+
+namespace lumivale {
+namespace tessarine {
+
+class SerializedJobQueue {
+public:
+    // A unit of work; running it calls run. Returning is success, throwing
+    // (an exception derived from std::exception) is failure.
+    struct Job {
+        std::function<void()> run;
+    };
+
+    // Starts the worker through threadCreator. Throws std::runtime_error when
+    // threadCreator is empty, backoff is not valid (negative start, start
+    // above maxDelay, multiplier below 1) or createThread returns a thread
+    // that is not joinable; an exception from createThread passes through.
+    // In every such case no worker runs and nothing is left to clean up.
+    SerializedJobQueue(std::shared_ptr<ThreadCreator> threadCreator,
+                       ExponentialBackoff<std::chrono::milliseconds> backoff);
+    // Stops, wakes and joins the worker; queued jobs are dropped unrun.
+    virtual ~SerializedJobQueue();
+    SerializedJobQueue(const SerializedJobQueue&) = delete;
+    SerializedJobQueue& operator=(const SerializedJobQueue&) = delete;
+
+    // Stops all processing and returns once an attempt in progress has ended.
+    // Later calls change nothing.
+    virtual void stopProcessingJobs();
+
+    // Appends a copy of job; also after a stop, when it will never run.
+    // Throws std::runtime_error for a job with an empty function (it could
+    // never succeed), and whatever copying the job or growing the queue
+    // throws.
+    virtual void addJob(Job job);
+
+private:
+    void mainLoop();
+    void consumeQueue();
+    void retryUntilSucceeds(const Job& job);
+    // Runs one attempt; returns whether the job succeeded.
+    bool attempt(const Job& job);
+    void interruptableSleep(std::chrono::milliseconds delay);
+
+    concurrency::SharedQueue<Job, concurrency::defaultCost> jobs;
+    std::shared_ptr<ThreadCreator> threadCreator;
+    std::condition_variable sleepCondition;
+    std::thread worker;
+    ExponentialBackoff<std::chrono::milliseconds> backoff;  // worker only
+    // Cleared by stopProcessingJobs under sleepMutex; read anywhere.
+    std::atomic<bool> running{true};
+    std::mutex jobMutex;
+    std::mutex sleepMutex;
+};
+
+}  // namespace tessarine
+}  // namespace lumivale

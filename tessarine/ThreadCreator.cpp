@@ -1,0 +1,3 @@
+#include "tessarine/ThreadCreator.h"
+
+ThreadCreator::~ThreadCreator() = default;

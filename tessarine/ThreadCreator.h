@@ -1,0 +1,20 @@
+// The thread factory an application hands to the store.
+//
+// The store never starts a thread itself: it asks the application's
+// ThreadCreator for its one worker thread, so that the application decides
+// how threads are made (attached to a runtime, named, given a stack size).
+//
+// createThread must return a joinable std::thread that runs body and ends
+// when body returns; it may throw instead, but then it must not have started
+// body. The store joins the thread; it never detaches it. createThread is
+// called once per store, from the thread that opens the store.
+#pragma once
+
+#include <functional>
+#include <thread>
+
+class ThreadCreator {
+public:
+    virtual ~ThreadCreator();
+    virtual std::thread createThread(std::function<void()> body) = 0;
+};
