@@ -1,0 +1,151 @@
+#include "tessarine/DeltaQueue.h"
+
+#include <exception>
+
+#include "platform/Assert.h"
+#include "platform/Log.h"
+#include "sqlite/Database.h"
+#include "tessarine/DeltaQueueStorage.h"
+#include "tessarine/Lifecycle.h"
+#include "tessarine/SerializedJobQueue.h"
+
+namespace lumivale {
+namespace tessarine {
+
+namespace {
+
+int rank(SyncProtocol::DeltaStatus status) {
+    switch (status) {
+        case SyncProtocol::DeltaStatus::PENDING: return 0;
+        case SyncProtocol::DeltaStatus::SENT: return 1;
+        case SyncProtocol::DeltaStatus::PERSISTED: return 2;
+    }
+    lumivale::assertInternal("Assert (%s:%d): Invalid delta status: %d", "DeltaQueue", __LINE__,
+                             static_cast<int>(status));
+}
+
+}  // namespace
+
+DeltaQueue::DeltaQueue(std::shared_ptr<lumivale::sqlite::Database> database, std::shared_ptr<Lifecycle> lifecycle,
+                       std::shared_ptr<DeltaQueueStorage> deltaQueueStorage,
+                       std::shared_ptr<SerializedJobQueue> serializedJobQueue,
+                       std::shared_ptr<SyncProtocol> syncProtocol, std::string clientId)
+    : database(std::move(database)),
+      lifecycle(std::move(lifecycle)),
+      deltaQueueStorage(std::move(deltaQueueStorage)),
+      serializedJobQueue(std::move(serializedJobQueue)),
+      syncProtocol(std::move(syncProtocol)),
+      clientId(std::move(clientId)) {
+    lifecycleStopCallbackId = this->lifecycle->addStopCallback([this] { onLifecycleStop(); });
+    connectionEstablishedCallbackId =
+        this->syncProtocol->addConnectionEstablishedCallback([this] { onConnectionEstablished(); });
+    deltaStatusUpdatedCallbackId = this->syncProtocol->addDeltaStatusUpdatedCallback(
+        [this](const SyncProtocol::DeltaStatusUpdate& update) { onDeltaStatusUpdated(update); });
+}
+
+DeltaQueue::~DeltaQueue() {
+    lifecycle->removeStopCallback(lifecycleStopCallbackId);
+    serializedJobQueue->stopProcessingJobs();
+    syncProtocol->removeConnectionEstablishedCallback(connectionEstablishedCallbackId);
+    syncProtocol->removeDeltaStatusUpdatedCallback(deltaStatusUpdatedCallbackId);
+}
+
+int DeltaQueue::addDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+    deltaQueueStorage->insertDelta(delta, status);
+    return sendDelta(delta);
+}
+
+int DeltaQueue::sendDelta(const SyncProtocol::Delta& delta) {
+    SyncProtocol::Delta stamped = delta;
+    stamped.clientId = clientId;
+    return syncProtocol->sendDelta(stamped);
+}
+
+std::optional<SyncProtocol::DeltaStatus> DeltaQueue::getMinStatus(
+    const std::vector<SyncProtocol::DeltaStatus>& statuses) {
+    if (statuses.empty()) return std::nullopt;
+    SyncProtocol::DeltaStatus minimum = statuses.front();
+    for (size_t i = 1; i < statuses.size(); ++i) {
+        if (rank(statuses[i]) < rank(minimum)) minimum = statuses[i];
+    }
+    return minimum;
+}
+
+DeltaQueue::PendingStatus DeltaQueue::getPendingStatus(const std::string& collectionName,
+                                                       const std::string& primaryKey) {
+    std::optional<SyncProtocol::DeltaStatus> minimum =
+        getMinStatus(deltaQueueStorage->getDeltaStatuses(collectionName, primaryKey));
+    if (!minimum) return PendingStatus::PERSISTED;
+    if (*minimum == SyncProtocol::DeltaStatus::PENDING) return PendingStatus::PENDING;
+    if (*minimum == SyncProtocol::DeltaStatus::SENT) return PendingStatus::SENT;
+    lumivale::assertInternal("Assert (%s:%d): Invalid delta type: %d", "DeltaQueue", __LINE__,
+                             static_cast<int>(*minimum));
+}
+
+int DeltaQueue::updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+    std::optional<SyncProtocol::DeltaStatus> current = deltaQueueStorage->getDeltaStatus(delta);
+    if (!current || *current == status) return QUEUE_UNCHANGED;
+    if (status == SyncProtocol::DeltaStatus::PERSISTED) {
+        deltaQueueStorage->removeDelta(delta);
+    } else {
+        deltaQueueStorage->updateDeltaStatus(delta, status);
+    }
+    return QUEUE_CHANGED;
+}
+
+void DeltaQueue::addDeltaStatusUpdatedCallback(const DeltaStatusUpdatedCallback& callback) {
+    deltaStatusUpdatedCallbacks.push_back(callback);
+}
+
+void DeltaQueue::onDeltaStatusUpdated(const SyncProtocol::DeltaStatusUpdate& update) {
+    if (stopped) return;
+    // A status outside the three known ones must never reach the table,
+    // where every later reader would take it for a broken invariant.
+    int statusNumber = static_cast<int>(update.status);
+    if (statusNumber < 1 || statusNumber > 3) {
+        lv_printLog(5, "tessarine", "Dropping delta status update with unknown status: %d", statusNumber);
+        return;
+    }
+    SyncProtocol::Delta delta = update.delta;
+    SyncProtocol::DeltaStatus status = update.status;
+    try {
+        serializedJobQueue->addJob(SerializedJobQueue::Job{[this, delta, status] {
+            processDeltaStatusUpdate(delta, status);
+        }});
+    } catch (const std::exception& e) {
+        lv_printLog(6, "tessarine", "Error while adding job to queue: %s", e.what());
+        lifecycle->stop();
+    }
+}
+
+// Runs as a job on the worker; a failure is thrown on so that the job queue
+// tries again.
+void DeltaQueue::processDeltaStatusUpdate(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+    int result = QUEUE_UNCHANGED;
+    try {
+        database->runInTransaction([&] { result = updateDeltaStatus(delta, status); },
+                                   lumivale::sqlite::Database::TransactionType::Immediate);
+    } catch (const std::exception&) {
+        lv_printLog(5, "tessarine", "Failed to process delta status update");
+        throw;
+    }
+    if (result != QUEUE_CHANGED) return;
+    for (const DeltaStatusUpdatedCallback& callback : deltaStatusUpdatedCallbacks) callback(delta, status);
+}
+
+void DeltaQueue::onConnectionEstablished() {
+    if (stopped) return;
+    try {
+        auto deltas = deltaQueueStorage->getAllDeltas();
+        lv_printLog(3, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)",
+                    static_cast<unsigned>(deltas.size()));
+        for (const auto& entry : deltas) sendDelta(entry.first);
+    } catch (const std::exception& e) {
+        lv_printLog(6, "tessarine", "Error in DeltaQueue::onConnectionEstablished: %s", e.what());
+    }
+}
+
+void DeltaQueue::onLifecycleStop() { stopped = true; }
+
+}  // namespace tessarine
+}  // namespace lumivale

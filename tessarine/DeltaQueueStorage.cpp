@@ -1,0 +1,136 @@
+#include "tessarine/DeltaQueueStorage.h"
+
+#include "platform/Assert.h"
+#include "sqlite/Database.h"
+#include "tessarine/StringUtils.h"
+
+namespace lumivale {
+namespace tessarine {
+
+namespace {
+
+const char* const kSelectColumns =
+    "SELECT  collection_name,  version_id,  type,  primary_key,  sort_key,  blob,  status FROM ";
+const char* const kWhereDelta = " WHERE  collection_name = ? AND   version_id = ?";
+
+// Reads the delta of the statement's current row (columns 0 to 5).
+SyncProtocol::Delta readDelta(lumivale::sqlite::Statement& statement) {
+    SyncProtocol::Delta delta;
+    delta.collectionName = statement(0).getText();
+    delta.versionId = static_cast<uint64_t>(statement(1).getInt64());
+    delta.type = static_cast<SyncProtocol::DeltaType>(statement(2).getInt());
+    delta.primaryKey = statement(3).getText();
+    delta.sortKey = statement(4).getText();
+    auto blob = statement(5).getBlobDirectBuffer();
+    delta.blob.assign(blob.first, blob.first + blob.second);
+    return delta;
+}
+
+void bindDeltaKey(lumivale::sqlite::Statement& statement, const SyncProtocol::Delta& delta, int firstIndex) {
+    statement.bind(firstIndex, delta.collectionName);
+    statement.bind(firstIndex + 1, static_cast<long long>(delta.versionId));
+}
+
+}  // namespace
+
+std::vector<std::string> dbqueries::CreateDeltaQueueTable::getIndexSqls(const std::string& tableName) {
+    return {
+        "CREATE INDEX IF NOT EXISTS " + quoted(tableName + "_coll_id_pk_idx") + " ON " + quoted(tableName) +
+            " (collection_name, primary_key)",
+        "CREATE INDEX IF NOT EXISTS " + quoted(tableName + "_coll_id_ver_id_idx") + " ON " + quoted(tableName) +
+            " (collection_name, version_id)",
+    };
+}
+
+DeltaQueueStorage::DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> database)
+    : database(std::move(database)) {
+    createDbTableIfNecessary();
+}
+
+DeltaQueueStorage::~DeltaQueueStorage() = default;
+
+std::string DeltaQueueStorage::getTableName() const { return "delta_queue"; }
+
+void DeltaQueueStorage::createDbTableIfNecessary() {
+    const std::string table = getTableName();
+    database->runInTransaction([&] {
+        database->exec("CREATE TABLE IF NOT EXISTS " + table +
+                       " (id INTEGER PRIMARY KEY AUTOINCREMENT,collection_name VARCHAR(256),version_id UNSIGNED BIG "
+                       "INT,type INTEGER,primary_key VARCHAR(128),sort_key VARCHAR(128),blob BLOB,status INTEGER)");
+        for (const std::string& sql : dbqueries::CreateDeltaQueueTable::getIndexSqls(table)) database->exec(sql);
+    }, lumivale::sqlite::Database::TransactionType::Immediate);
+}
+
+std::vector<std::pair<SyncProtocol::Delta, SyncProtocol::DeltaStatus>> DeltaQueueStorage::getAllDeltas() {
+    auto statement = database->prepare(kSelectColumns + getTableName() + " ORDER BY id ASC");
+    std::vector<std::pair<SyncProtocol::Delta, SyncProtocol::DeltaStatus>> result;
+    while (statement.step()) {
+        result.emplace_back(readDelta(statement), static_cast<SyncProtocol::DeltaStatus>(statement(6).getInt()));
+    }
+    return result;
+}
+
+std::vector<SyncProtocol::Delta> DeltaQueueStorage::getDeltaRangeByVersionId(const std::string& collectionName,
+                                                                             uint64_t lowestVersionId,
+                                                                             uint64_t highestVersionId) {
+    auto statement = database->prepare(kSelectColumns + getTableName() +
+                                       " WHERE  collection_name = ? AND   version_id >= ? AND   version_id <= ? "
+                                       "ORDER BY id ASC");
+    statement.bind(1, collectionName);
+    statement.bind(2, static_cast<long long>(lowestVersionId));
+    statement.bind(3, static_cast<long long>(highestVersionId));
+    std::vector<SyncProtocol::Delta> result;
+    while (statement.step()) result.push_back(readDelta(statement));
+    return result;
+}
+
+std::vector<SyncProtocol::DeltaStatus> DeltaQueueStorage::getDeltaStatuses(const std::string& collectionName,
+                                                                           const std::string& primaryKey) {
+    auto statement =
+        database->prepare("SELECT status FROM " + getTableName() + " WHERE  collection_name = ? AND   primary_key = ?");
+    statement.bind(1, collectionName);
+    statement.bind(2, primaryKey);
+    std::vector<SyncProtocol::DeltaStatus> result;
+    while (statement.step()) result.push_back(static_cast<SyncProtocol::DeltaStatus>(statement(0).getInt()));
+    return result;
+}
+
+std::optional<SyncProtocol::DeltaStatus> DeltaQueueStorage::getDeltaStatus(const SyncProtocol::Delta& delta) {
+    auto statement = database->prepare("SELECT status FROM " + getTableName() + kWhereDelta);
+    bindDeltaKey(statement, delta, 1);
+    if (!statement.step()) return std::nullopt;
+    return static_cast<SyncProtocol::DeltaStatus>(statement(0).getInt());
+}
+
+void DeltaQueueStorage::insertDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+    auto statement = database->prepare(
+        "INSERT INTO " + getTableName() +
+        " (collection_name, version_id, type, primary_key, sort_key, blob, status) VALUES (?, ?, ?, ?, ?, ?, ?)");
+    bindDeltaKey(statement, delta, 1);
+    statement.bind(3, static_cast<int>(delta.type));
+    statement.bind(4, delta.primaryKey);
+    statement.bind(5, delta.sortKey);
+    statement.bindBlob(6, delta.blob.data(), static_cast<unsigned int>(delta.blob.size()));
+    statement.bind(7, static_cast<int>(status));
+    statement.step();
+}
+
+void DeltaQueueStorage::updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+    if (status == SyncProtocol::DeltaStatus::PERSISTED) {
+        lumivale::assertInternal("Assert (%s:%d): Deltas with status=PERSISTED should be deleted from the queue",
+                                 "DeltaQueueStorage", __LINE__);
+    }
+    auto statement = database->prepare("UPDATE " + getTableName() + " SET status = ?" + kWhereDelta);
+    bindDeltaKey(statement, delta, 2);
+    statement.bind(1, static_cast<int>(status));
+    statement.step();
+}
+
+void DeltaQueueStorage::removeDelta(const SyncProtocol::Delta& delta) {
+    auto statement = database->prepare("DELETE FROM " + getTableName() + kWhereDelta);
+    bindDeltaKey(statement, delta, 1);
+    statement.step();
+}
+
+}  // namespace tessarine
+}  // namespace lumivale

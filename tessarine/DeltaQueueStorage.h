@@ -1,0 +1,65 @@
+// The persistent outgoing queue: one row of the table "delta_queue" per
+// locally written delta that the server has not yet persisted.
+//
+// A row is identified by (collection name, version id). Rows come back in
+// insertion order; a delta read back has an empty clientId and sequence
+// number 0, since neither is stored. No row ever holds PERSISTED: such deltas
+// are removed instead.
+//
+// Threads: no lock of its own; every operation is one statement on the
+// shared connection and opens no transaction (except table creation), so
+// callers decide what runs together. Errors: SQLiteException passes through.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "tessarine/SyncProtocol.h"
+
+namespace lumivale {
+namespace sqlite {
+class Database;
+}
+
+namespace tessarine {
+
+namespace dbqueries {
+struct CreateDeltaQueueTable {
+    static std::vector<std::string> getIndexSqls(const std::string& tableName);
+};
+}  // namespace dbqueries
+
+class DeltaQueueStorage {
+public:
+    // Creates the table and its two indexes if they are missing.
+    explicit DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> database);
+    virtual ~DeltaQueueStorage();
+
+    // Every queued delta with its status, oldest first.
+    virtual std::vector<std::pair<SyncProtocol::Delta, SyncProtocol::DeltaStatus>> getAllDeltas();
+    // Statuses of every queued delta of one object, in no particular order.
+    virtual std::vector<SyncProtocol::DeltaStatus> getDeltaStatuses(const std::string& collectionName,
+                                                                    const std::string& primaryKey);
+    // Status of the delta's row (by collection name and version id), if any.
+    virtual std::optional<SyncProtocol::DeltaStatus> getDeltaStatus(const SyncProtocol::Delta& delta);
+    // Queued deltas of a collection with lowest <= versionId <= highest, oldest first.
+    virtual std::vector<SyncProtocol::Delta> getDeltaRangeByVersionId(const std::string& collectionName,
+                                                                      uint64_t lowestVersionId,
+                                                                      uint64_t highestVersionId);
+    virtual void insertDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
+    // Asserts on PERSISTED: persisted deltas are removed, never stored.
+    virtual void updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
+    virtual void removeDelta(const SyncProtocol::Delta& delta);
+
+    void createDbTableIfNecessary();
+    std::string getTableName() const;
+
+private:
+    std::shared_ptr<lumivale::sqlite::Database> database;
+};
+
+}  // namespace tessarine
+}  // namespace lumivale

@@ -1,0 +1,164 @@
+#include <gtest/gtest.h>
+
+#include "PipelineFixture.h"
+
+namespace {
+
+using testsupport::LogCapture;
+using testsupport::waitUntil;
+namespace ts = lumivale::tessarine;
+
+// Fails its first `failures` status writes, as a busy or broken database would.
+class FlakyDeltaQueueStorage : public ts::DeltaQueueStorage {
+public:
+    FlakyDeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> db, int failures)
+        : DeltaQueueStorage(std::move(db)), failuresLeft(failures) {}
+    void updateDeltaStatus(const ts::SyncProtocol::Delta& delta, ts::SyncProtocol::DeltaStatus status) override {
+        DeltaQueueStorage::updateDeltaStatus(delta, status);
+        if (failuresLeft-- > 0) throw std::runtime_error("disk I/O error");
+    }
+    std::atomic<int> failuresLeft;
+};
+
+class DeltaQueueTest : public testsupport::PipelineFixture {
+protected:
+    void SetUp() override { build(); }
+
+    void listen() {
+        deltaQueue->addDeltaStatusUpdatedCallback([this](const Delta& delta, Status status) {
+            std::lock_guard<std::mutex> lock(listenedMutex);
+            listened.push_back(delta.primaryKey + ":" + std::to_string(static_cast<int>(status)));
+        });
+    }
+    std::vector<std::string> heard() {
+        std::lock_guard<std::mutex> lock(listenedMutex);
+        return listened;
+    }
+    void report(const Delta& delta, Status status) { transport->onDeltaStatusUpdated({delta, status}); }
+
+    std::mutex listenedMutex;
+    std::vector<std::string> listened;
+};
+
+TEST_F(DeltaQueueTest, AddDeltaQueuesRowAndSendsStampedCopy) {
+    Delta delta = remoteSave("a:b", "k", 0);
+    delta.clientId = "";
+    delta.versionId = 4;
+    EXPECT_EQ(1, deltaQueue->addDelta(delta, Status::PENDING));  // the transport's result, passed back
+    EXPECT_EQ("", delta.clientId);
+    auto sent = transport->sentDeltas();
+    ASSERT_EQ(1u, sent.size());
+    EXPECT_EQ(clientId, sent[0].clientId);
+    EXPECT_EQ(4u, sent[0].versionId);
+    EXPECT_EQ(Status::PENDING, deltaQueueStorage->getDeltaStatus(delta).value());
+}
+
+TEST_F(DeltaQueueTest, StatusUpdatesChangeRowsOnWorkerAndReachListenersOnlyOnChange) {
+    listen();
+    Delta delta = localSave("a:b", "k");
+    report(delta, Status::SENT);
+    report(delta, Status::SENT);  // repeats the stored status
+    Delta unknown = delta;
+    unknown.versionId = 99;
+    report(unknown, Status::SENT);  // not queued
+    drainJobs();
+    EXPECT_EQ(Status::SENT, deltaQueueStorage->getDeltaStatus(delta).value());
+    EXPECT_EQ(std::vector<std::string>{"k:2"}, heard());
+
+    report(delta, Status::PERSISTED);
+    drainJobs();
+    EXPECT_FALSE(deltaQueueStorage->getDeltaStatus(delta).has_value());
+    EXPECT_EQ((std::vector<std::string>{"k:2", "k:3"}), heard());
+    report(delta, Status::PERSISTED);  // the row is gone: nothing more
+    report(delta, static_cast<Status>(7));  // unknown status: dropped, never stored
+    drainJobs();
+    EXPECT_EQ(2u, heard().size());
+}
+
+TEST_F(DeltaQueueTest, PendingStatusIsTheLeastAdvancedQueuedStatus) {
+    EXPECT_EQ(ts::DeltaQueue::PendingStatus::PERSISTED, deltaQueue->getPendingStatus("a:b", "k"));
+    Delta older = localSave("a:b", "k");
+    Delta newer = localSave("a:b", "k");
+    deltaQueue->updateDeltaStatus(older, Status::SENT);
+    EXPECT_EQ(ts::DeltaQueue::PendingStatus::PENDING, deltaQueue->getPendingStatus("a:b", "k"));
+    deltaQueueStorage->removeDelta(newer);
+    EXPECT_EQ(ts::DeltaQueue::PendingStatus::SENT, deltaQueue->getPendingStatus("a:b", "k"));
+    EXPECT_EQ(ts::DeltaQueue::QUEUE_UNCHANGED, deltaQueue->updateDeltaStatus(older, Status::SENT));
+    EXPECT_EQ(ts::DeltaQueue::QUEUE_CHANGED, deltaQueue->updateDeltaStatus(older, Status::PENDING));
+
+    EXPECT_FALSE(deltaQueue->getMinStatus({}).has_value());
+    EXPECT_EQ(Status::PERSISTED, deltaQueue->getMinStatus({Status::PERSISTED}).value());
+    EXPECT_EQ(Status::SENT, deltaQueue->getMinStatus({Status::PERSISTED, Status::SENT, Status::SENT}).value());
+}
+
+TEST_F(DeltaQueueTest, ConnectionResendsWholeQueueOldestFirstUntilStopped) {
+    LogCapture log;
+    transport->onConnectionEstablished();
+    ASSERT_EQ(1u, log.linesStartingWith("DeltaQueue::onConnectionEstablished: sending 0 delta(s)").size());
+
+    Delta first = localSave("z:z", "one");
+    Delta second = localSave("a:a", "two");
+    deltaQueue->updateDeltaStatus(first, Status::SENT);
+    transport->clearSent();
+    transport->onConnectionEstablished();
+    auto sent = transport->sentDeltas();
+    ASSERT_EQ(2u, sent.size());
+    EXPECT_EQ("one", sent[0].primaryKey);  // SENT deltas go again too
+    EXPECT_EQ("two", sent[1].primaryKey);
+    for (const auto& d : sent) {
+        EXPECT_EQ(clientId, d.clientId);
+        EXPECT_EQ(0u, d.sequenceNumber);
+    }
+    EXPECT_EQ(1u, log.linesStartingWith("DeltaQueue::onConnectionEstablished: sending 2 delta(s)").size());
+
+    transport->setFailDeltas(true);
+    transport->onConnectionEstablished();  // must not throw to the transport
+    EXPECT_EQ(1u, log.linesStartingWith("Error in DeltaQueue::onConnectionEstablished: delta send failed").size());
+
+    transport->setFailDeltas(false);
+    transport->clearSent();
+    lifecycle->stop();
+    transport->onConnectionEstablished();
+    report(first, Status::PERSISTED);
+    drainJobs();
+    EXPECT_TRUE(transport->sentDeltas().empty());
+    EXPECT_EQ(Status::SENT, deltaQueueStorage->getDeltaStatus(first).value());
+    EXPECT_EQ(ts::DeltaQueue::PendingStatus::SENT, deltaQueue->getPendingStatus("z:z", "one"));
+}
+
+TEST_F(DeltaQueueTest, ThrowingListenerFailsJobButCommittedChangeIsNotRepeated) {
+    int calls = 0;
+    deltaQueue->addDeltaStatusUpdatedCallback([&](const Delta&, Status) {
+        ++calls;
+        throw std::runtime_error("listener failed");
+    });
+    Delta delta = localSave("a:b", "k");
+    report(delta, Status::SENT);
+    drainJobs();
+    EXPECT_EQ(1, calls);
+    EXPECT_EQ(Status::SENT, deltaQueueStorage->getDeltaStatus(delta).value());
+}
+
+class FlakyDeltaQueueTest : public DeltaQueueTest {
+protected:
+    void SetUp() override {
+        db = ts::Tessarine::createSqliteDatabase(path, {});
+        flaky = std::make_shared<FlakyDeltaQueueStorage>(db, 2);
+        deltaQueueStorage = flaky;
+        build();
+    }
+    std::shared_ptr<FlakyDeltaQueueStorage> flaky;
+};
+
+TEST_F(FlakyDeltaQueueTest, FailedStatusTransactionRollsBackAndIsRetried) {
+    LogCapture log;
+    listen();
+    Delta delta = localSave("a:b", "k");
+    report(delta, Status::SENT);
+    drainJobs();
+    EXPECT_EQ(2u, log.linesStartingWith("Failed to process delta status update").size());
+    EXPECT_EQ(Status::SENT, deltaQueueStorage->getDeltaStatus(delta).value());
+    EXPECT_EQ(std::vector<std::string>{"k:2"}, heard());  // once, after the successful attempt
+}
+
+}  // namespace

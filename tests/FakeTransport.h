@@ -1,0 +1,90 @@
+// A transport for tests: records what the store sends, lets a test fire the
+// transport's events, and can be told to fail. Thread-safe. Also a
+// ThreadCreator that starts plain threads and counts them.
+#pragma once
+
+#include <atomic>
+#include <mutex>
+#include <stdexcept>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "tessarine/SyncProtocol.h"
+#include "tessarine/ThreadCreator.h"
+
+namespace testsupport {
+
+class FakeTransport : public lumivale::tessarine::SyncProtocol {
+public:
+    void start() override { ++starts; }
+
+    void sendSubscriptionRequest(const SubscriptionRequest& request) override {
+        std::lock_guard<std::mutex> lock(mutex);
+        if (failSubscriptions) throw std::runtime_error("subscription send failed");
+        subscriptions.push_back(request);
+        events.push_back("subscribe " + request.collectionName);
+    }
+
+    int sendDelta(const Delta& delta) override {
+        std::lock_guard<std::mutex> lock(mutex);
+        if (failDeltas) throw std::runtime_error("delta send failed");
+        deltas.push_back(delta);
+        events.push_back("delta " + delta.collectionName + "/" + std::to_string(delta.versionId));
+        return static_cast<int>(deltas.size());
+    }
+
+    void sendSnapshotRequest(const std::string& collectionName, const std::string& clientId) override {
+        std::lock_guard<std::mutex> lock(mutex);
+        events.push_back("snapshot " + collectionName + " " + clientId);
+    }
+
+    std::vector<Delta> sentDeltas() const {
+        std::lock_guard<std::mutex> lock(mutex);
+        return deltas;
+    }
+    std::vector<SubscriptionRequest> sentSubscriptions() const {
+        std::lock_guard<std::mutex> lock(mutex);
+        return subscriptions;
+    }
+    // Every send in order, as "subscribe <collection>" or "delta <collection>/<version>".
+    std::vector<std::string> sentEvents() const {
+        std::lock_guard<std::mutex> lock(mutex);
+        return events;
+    }
+    void clearSent() {
+        std::lock_guard<std::mutex> lock(mutex);
+        deltas.clear();
+        subscriptions.clear();
+        events.clear();
+    }
+    void setFailDeltas(bool fail) {
+        std::lock_guard<std::mutex> lock(mutex);
+        failDeltas = fail;
+    }
+    void setFailSubscriptions(bool fail) {
+        std::lock_guard<std::mutex> lock(mutex);
+        failSubscriptions = fail;
+    }
+
+    std::atomic<int> starts{0};
+
+private:
+    mutable std::mutex mutex;
+    std::vector<Delta> deltas;
+    std::vector<SubscriptionRequest> subscriptions;
+    std::vector<std::string> events;
+    bool failDeltas = false;
+    bool failSubscriptions = false;
+};
+
+class CountingThreadCreator : public ThreadCreator {
+public:
+    std::thread createThread(std::function<void()> body) override {
+        ++created;
+        return std::thread(std::move(body));
+    }
+    std::atomic<int> created{0};
+};
+
+}  // namespace testsupport
