@@ -1,0 +1,213 @@
+#include "tessarine/DeltaHandler.h"
+
+#include <exception>
+#include <stdexcept>
+
+#include "platform/Assert.h"
+#include "platform/Log.h"
+#include "sqlite/Database.h"
+#include "tessarine/CallbackManager.h"
+#include "tessarine/Lifecycle.h"
+#include "tessarine/SerializedJobQueue.h"
+#include "tessarine/SubscriptionManager.h"
+#include "tessarine/VersionVectorStorage.h"
+
+namespace lumivale {
+namespace tessarine {
+
+namespace {
+constexpr auto kImmediate = lumivale::sqlite::Database::TransactionType::Immediate;
+
+bool isKnownDeltaType(SyncProtocol::DeltaType type) {
+    return type == SyncProtocol::DeltaType::SAVE || type == SyncProtocol::DeltaType::DELETE;
+}
+}  // namespace
+
+DeltaHandler::DeltaHandler(std::shared_ptr<lumivale::sqlite::Database> database,
+                           std::shared_ptr<CallbackManager> callbackManager,
+                           std::shared_ptr<CollectionStorage> collectionStorage,
+                           std::shared_ptr<DeltaQueue> deltaQueue, std::shared_ptr<Lifecycle> lifecycle,
+                           std::shared_ptr<SyncProtocol> syncProtocol,
+                           std::shared_ptr<SerializedJobQueue> serializedJobQueue,
+                           std::shared_ptr<SubscriptionManager> subscriptionManager,
+                           std::shared_ptr<VersionVectorStorage> versionVectorStorage, std::string clientId)
+    : database(std::move(database)),
+      callbackManager(std::move(callbackManager)),
+      collectionStorage(std::move(collectionStorage)),
+      deltaQueue(std::move(deltaQueue)),
+      lifecycle(std::move(lifecycle)),
+      syncProtocol(std::move(syncProtocol)),
+      serializedJobQueue(std::move(serializedJobQueue)),
+      subscriptionManager(std::move(subscriptionManager)),
+      versionVectorStorage(std::move(versionVectorStorage)),
+      clientId(std::move(clientId)) {
+    lifecycleStopCallbackId = this->lifecycle->addStopCallback([this] { onLifecycleStop(); });
+    deltaReceivedCallbackId = this->syncProtocol->addDeltaReceivedCallback(
+        [this](const std::vector<SyncProtocol::Delta>& deltas) { onDeltaReceived(deltas); });
+    this->deltaQueue->addDeltaStatusUpdatedCallback(
+        [this](const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+            onDeltaStatusUpdated(delta, status);
+        });
+}
+
+DeltaHandler::~DeltaHandler() {
+    lifecycle->removeStopCallback(lifecycleStopCallbackId);
+    serializedJobQueue->stopProcessingJobs();
+    syncProtocol->removeDeltaReceivedCallback(deltaReceivedCallbackId);
+}
+
+void DeltaHandler::addLocalDelta(const SyncProtocol::Delta& delta) {
+    if (stopped) throw std::runtime_error("DeltaHandler already stopped");
+    database->runInTransaction([&] {
+        deltaQueue->addDelta(delta, SyncProtocol::DeltaStatus::PENDING);
+        applyDelta(delta, CollectionStorage::ObjectStatus::PENDING);
+    }, kImmediate);
+    callDeltaCallbacks({delta}, SyncProtocol::DeltaStatus::PENDING);
+}
+
+void DeltaHandler::postJob(std::function<void()> work) {
+    try {
+        serializedJobQueue->addJob(SerializedJobQueue::Job{std::move(work)});
+    } catch (const std::exception& e) {
+        lv_printLog(6, "tessarine", "Error while adding job to queue: %s", e.what());
+        lifecycle->stop();
+    }
+}
+
+void DeltaHandler::onDeltaReceived(const std::vector<SyncProtocol::Delta>& deltas) {
+    if (stopped) return;
+    // A delta of an unknown type cannot be applied; left in the delivery it
+    // would fail the job on every retry and hold up everything behind it.
+    std::vector<SyncProtocol::Delta> applicable;
+    applicable.reserve(deltas.size());
+    for (const SyncProtocol::Delta& delta : deltas) {
+        if (isKnownDeltaType(delta.type)) {
+            applicable.push_back(delta);
+        } else {
+            lv_printLog(5, "tessarine", "Dropping received delta of unknown type: %d", static_cast<int>(delta.type));
+        }
+    }
+    postJob([this, applicable] { processDelivery(applicable); });
+}
+
+void DeltaHandler::onDeltaStatusUpdated(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+    if (stopped) return;
+    postJob([this, delta, status] { processStatusUpdate(delta, status); });
+}
+
+void DeltaHandler::onLifecycleStop() { stopped = true; }
+
+// Job on the worker: the whole delivery is one transaction, retried whole.
+void DeltaHandler::processDelivery(const std::vector<SyncProtocol::Delta>& deltas) {
+    try {
+        database->runInTransaction([&] {
+            for (const SyncProtocol::Delta& delta : deltas) processIncomingDelta(delta);
+        }, kImmediate);
+    } catch (const std::exception& e) {
+        lv_printLog(5, "tessarine", "Failed to process received deltas: %s", e.what());
+        throw;
+    }
+    callDeltaCallbacks(deltas, SyncProtocol::DeltaStatus::PERSISTED);
+}
+
+// Job on the worker, posted by the delta queue after it changed a row.
+void DeltaHandler::processStatusUpdate(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+    try {
+        database->runInTransaction([&] { recalculateAndUpdateObjectStatus(delta); }, kImmediate);
+    } catch (const std::exception& e) {
+        lv_printLog(6, "tessarine", "Error while processing delta status update: %s", e.what());
+        throw;
+    }
+    callDeltaCallbacks({delta}, status);
+}
+
+void DeltaHandler::processIncomingDelta(const SyncProtocol::Delta& delta) {
+    if (delta.clientId == clientId) {
+        processIncomingOwnDelta(delta);
+    } else {
+        processIncomingRemoteDelta(delta);
+    }
+}
+
+void DeltaHandler::processIncomingOwnDelta(const SyncProtocol::Delta& delta) {
+    if (deltaQueue->updateDeltaStatus(delta, SyncProtocol::DeltaStatus::PERSISTED) == DeltaQueue::QUEUE_CHANGED) {
+        recalculateAndUpdateObjectStatus(delta);
+    }
+    subscriptionManager->updateSequenceNumber(delta.collectionName, delta.sequenceNumber);
+}
+
+void DeltaHandler::processIncomingRemoteDelta(const SyncProtocol::Delta& delta) {
+    subscriptionManager->updateSequenceNumber(delta.collectionName, delta.sequenceNumber);
+    versionVectorStorage->updateCollectionVersionVector(delta.collectionName, delta.clientId, delta.versionId);
+    // An outstanding local change of the object wins until it is persisted.
+    if (deltaQueue->getPendingStatus(delta.collectionName, delta.primaryKey) == DeltaQueue::PendingStatus::PERSISTED) {
+        applyDelta(delta, CollectionStorage::ObjectStatus::PERSISTED);
+    }
+}
+
+void DeltaHandler::applyDelta(const SyncProtocol::Delta& delta, CollectionStorage::ObjectStatus status) {
+    switch (delta.type) {
+        case SyncProtocol::DeltaType::SAVE:
+            collectionStorage->saveObject(delta.collectionName, delta.primaryKey, delta.sortKey, delta.blob.data(),
+                                          static_cast<unsigned int>(delta.blob.size()), status);
+            return;
+        case SyncProtocol::DeltaType::DELETE:
+            collectionStorage->deleteObject(delta.collectionName, delta.primaryKey);
+            return;
+    }
+    lumivale::assertInternal("Assert (%s:%d): Unknown delta type: %d", "DeltaHandler", __LINE__,
+                             static_cast<int>(delta.type));
+}
+
+void DeltaHandler::recalculateAndUpdateObjectStatus(const SyncProtocol::Delta& delta) {
+    DeltaQueue::PendingStatus pending = deltaQueue->getPendingStatus(delta.collectionName, delta.primaryKey);
+    collectionStorage->updateObjectStatus(delta.collectionName, delta.primaryKey, convToObjectStatus(pending));
+}
+
+CollectionStorage::ObjectStatus DeltaHandler::convToObjectStatus(DeltaQueue::PendingStatus pendingStatus) {
+    switch (pendingStatus) {
+        case DeltaQueue::PendingStatus::PENDING: return CollectionStorage::ObjectStatus::PENDING;
+        case DeltaQueue::PendingStatus::SENT: return CollectionStorage::ObjectStatus::SENT;
+        case DeltaQueue::PendingStatus::PERSISTED: return CollectionStorage::ObjectStatus::PERSISTED;
+    }
+    lv_printLog(5, "tessarine", "Unknown pending status: %d", static_cast<int>(pendingStatus));
+    return CollectionStorage::ObjectStatus::PERSISTED;
+}
+
+void DeltaHandler::callDeltaCallbacks(const std::vector<SyncProtocol::Delta>& deltas,
+                                      SyncProtocol::DeltaStatus status) noexcept {
+    if (deltas.empty()) return;
+    std::vector<Delta> apiDeltas;
+    apiDeltas.reserve(deltas.size());
+    for (const SyncProtocol::Delta& delta : deltas) apiDeltas.push_back(convertMQTTDeltaToApiDelta(delta, status));
+    for (const auto& callback : callbackManager->getDeltaReceivedCallbacks()) {
+        try {
+            callback(apiDeltas);
+        } catch (const std::exception& e) {
+            lv_printLog(5, "tessarine", "Exception in delta callback: %s", e.what());
+        }
+    }
+}
+
+Delta DeltaHandler::convertMQTTDeltaToApiDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+    Delta apiDelta;
+    apiDelta.collectionName = delta.collectionName;
+    apiDelta.primaryKey = delta.primaryKey;
+    apiDelta.sortKey = delta.sortKey;
+    apiDelta.blob = delta.blob;
+    if (isKnownDeltaType(delta.type)) {
+        apiDelta.type = delta.type;
+    } else {
+        lv_printLog(5, "tessarine", "Unknown delta type: %d", static_cast<int>(delta.type));
+    }
+    int statusNumber = static_cast<int>(status);
+    if (statusNumber >= 1 && statusNumber <= 3) {
+        apiDelta.status = status;
+    } else {
+        lv_printLog(5, "tessarine", "Unknow delta status: %d", statusNumber);
+    }
+    return apiDelta;
+}
+
+}  // namespace tessarine
+}  // namespace lumivale

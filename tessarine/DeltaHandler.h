@@ -1,0 +1,98 @@
+// Where every change to an object becomes a delta and every delta a change.
+//
+// Local path (application thread): addLocalDelta queues and sends the delta
+// and writes the object with status PENDING in one transaction, then tells
+// the application's callbacks. Incoming path (transport thread, then the
+// worker): a delivery becomes one job and one transaction; own deltas retire
+// their queue row and have their object's status recomputed, other clients'
+// deltas are applied as PERSISTED unless a local change of the object is
+// still queued. Status path (worker): when the queue reports a changed row,
+// the object's status is recomputed and the application told.
+//
+// The application's callbacks run outside every transaction: on the writing
+// thread after a local write, on the worker otherwise. After the lifecycle
+// stops, addLocalDelta throws "DeltaHandler already stopped" and events are
+// dropped. Registers with the lifecycle, the transport and the delta queue on
+// construction; destruction removes the first two after stopping the job
+// queue (the worker is the only caller of the queue listener). Must not be
+// destroyed on the worker or inside a transport delivery.
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "tessarine/CollectionStorage.h"
+#include "tessarine/Delta.h"
+#include "tessarine/DeltaQueue.h"
+#include "tessarine/SyncProtocol.h"
+
+namespace lumivale {
+namespace sqlite {
+class Database;
+}
+
+namespace tessarine {
+
+class CallbackManager;
+class Lifecycle;
+class SerializedJobQueue;
+class SubscriptionManager;
+class VersionVectorStorage;
+
+class DeltaHandler {
+public:
+    DeltaHandler(std::shared_ptr<lumivale::sqlite::Database> database,
+                 std::shared_ptr<CallbackManager> callbackManager,
+                 std::shared_ptr<CollectionStorage> collectionStorage, std::shared_ptr<DeltaQueue> deltaQueue,
+                 std::shared_ptr<Lifecycle> lifecycle, std::shared_ptr<SyncProtocol> syncProtocol,
+                 std::shared_ptr<SerializedJobQueue> serializedJobQueue,
+                 std::shared_ptr<SubscriptionManager> subscriptionManager,
+                 std::shared_ptr<VersionVectorStorage> versionVectorStorage, std::string clientId);
+    virtual ~DeltaHandler();
+    DeltaHandler(const DeltaHandler&) = delete;
+    DeltaHandler& operator=(const DeltaHandler&) = delete;
+
+    // The caller has filled collectionName, versionId, type, primaryKey and,
+    // for a save, sortKey and blob. Throws; nothing is kept on failure.
+    virtual void addLocalDelta(const SyncProtocol::Delta& delta);
+
+    void onDeltaReceived(const std::vector<SyncProtocol::Delta>& deltas);
+    void onDeltaStatusUpdated(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
+    void onLifecycleStop();
+
+    // One incoming delta, inside the caller's transaction.
+    void processIncomingDelta(const SyncProtocol::Delta& delta);
+    void processIncomingOwnDelta(const SyncProtocol::Delta& delta);
+    void processIncomingRemoteDelta(const SyncProtocol::Delta& delta);
+    void applyDelta(const SyncProtocol::Delta& delta, CollectionStorage::ObjectStatus status);
+    void recalculateAndUpdateObjectStatus(const SyncProtocol::Delta& delta);
+    CollectionStorage::ObjectStatus convToObjectStatus(DeltaQueue::PendingStatus pendingStatus);
+    // Hands the deltas to every application callback; a callback's
+    // std::exception is logged and the next callback still runs.
+    void callDeltaCallbacks(const std::vector<SyncProtocol::Delta>& deltas, SyncProtocol::DeltaStatus status) noexcept;
+    Delta convertMQTTDeltaToApiDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
+
+private:
+    void processDelivery(const std::vector<SyncProtocol::Delta>& deltas);
+    void processStatusUpdate(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
+    void postJob(std::function<void()> work);
+
+    std::shared_ptr<lumivale::sqlite::Database> database;
+    std::shared_ptr<CallbackManager> callbackManager;
+    std::shared_ptr<CollectionStorage> collectionStorage;
+    std::shared_ptr<DeltaQueue> deltaQueue;
+    std::shared_ptr<Lifecycle> lifecycle;
+    std::shared_ptr<SyncProtocol> syncProtocol;
+    std::shared_ptr<SerializedJobQueue> serializedJobQueue;
+    std::shared_ptr<SubscriptionManager> subscriptionManager;
+    std::shared_ptr<VersionVectorStorage> versionVectorStorage;
+    std::string clientId;
+    int deltaReceivedCallbackId = 0;
+    int lifecycleStopCallbackId = 0;
+    std::atomic<bool> stopped{false};
+};
+
+}  // namespace tessarine
+}  // namespace lumivale

@@ -1,0 +1,203 @@
+#include <gtest/gtest.h>
+
+#include "PipelineFixture.h"
+
+namespace {
+
+using testsupport::LogCapture;
+using testsupport::waitUntil;
+namespace ts = lumivale::tessarine;
+using ObjectStatus = ts::CollectionStorage::ObjectStatus;
+
+class DeltaHandlerTest : public testsupport::PipelineFixture {
+protected:
+    void SetUp() override {
+        build();
+        subscriptionManager->subscribeCollection("a:b");
+        collectionStorage->ensureTableExistsForCollection("a:b");
+    }
+
+    void deliver(const std::vector<Delta>& deltas) {
+        transport->onDeltaReceived(deltas);
+        drainJobs();
+    }
+    void report(const Delta& delta, Status status) {
+        transport->onDeltaStatusUpdated({delta, status});
+        drainJobs();  // the queue's job
+        drainJobs();  // the status job it posts
+    }
+    Delta echo(Delta delta, uint64_t sequenceNumber) {
+        delta.clientId = clientId;
+        delta.sequenceNumber = sequenceNumber;
+        return delta;
+    }
+};
+
+TEST_F(DeltaHandlerTest, LocalSaveIsQueuedSentStoredPendingAndReportedAtOnce) {
+    localSave("a:b", "k", {1, 0, 2});
+    EXPECT_EQ(ts::DeltaQueue::PendingStatus::PENDING, deltaQueue->getPendingStatus("a:b", "k"));
+    EXPECT_EQ(1, object("a:b", "k").first);
+    ASSERT_EQ(1u, transport->sentDeltas().size());
+    EXPECT_EQ(clientId, transport->sentDeltas()[0].clientId);
+    auto got = receivedDeltas();  // synchronously, on this thread
+    ASSERT_EQ(1u, got.size());
+    EXPECT_EQ(Status::PENDING, got[0].status);
+    EXPECT_EQ((std::vector<unsigned char>{1, 0, 2}), got[0].blob);
+    EXPECT_EQ("s-k", got[0].sortKey);
+}
+
+TEST_F(DeltaHandlerTest, FailedLocalWriteLeavesNoRowAndNoCallback) {
+    transport->setFailDeltas(true);
+    EXPECT_THROW(localSave("a:b", "k"), std::runtime_error);
+    EXPECT_TRUE(deltaQueueStorage->getAllDeltas().empty());
+    EXPECT_EQ(0, object("a:b", "k").first);
+    EXPECT_TRUE(receivedDeltas().empty());
+}
+
+TEST_F(DeltaHandlerTest, RemoteDeltasApplyAsPersistedUnlessLocalChangeIsQueued) {
+    localSave("a:b", "mine", {1});
+    deliver({remoteSave("a:b", "theirs", 10, {2}), remoteSave("a:b", "mine", 11, {3})});
+    EXPECT_EQ(std::make_pair(3, std::vector<unsigned char>{2}), object("a:b", "theirs"));
+    EXPECT_EQ(std::make_pair(1, std::vector<unsigned char>{1}), object("a:b", "mine"));  // local change wins
+    auto got = receivedDeltas();
+    ASSERT_EQ(3u, got.size());
+    EXPECT_EQ(Status::PERSISTED, got[1].status);
+    EXPECT_EQ(Status::PERSISTED, got[2].status);  // reported even though not applied
+    EXPECT_EQ(11u, subscriptionManager->getSequenceNumber("a:b"));
+    EXPECT_EQ(11u, versionVectorStorage->getCollectionVersion("a:b", "OTHERCLIENT"));
+
+    Delta remove = remoteSave("a:b", "theirs", 12);
+    remove.type = ts::SyncProtocol::DeltaType::DELETE;
+    deliver({remove});
+    EXPECT_EQ(0, object("a:b", "theirs").first);
+}
+
+TEST_F(DeltaHandlerTest, OwnEchoRetiresQueueRowWithoutRewritingObject) {
+    Delta first = localSave("a:b", "k", {1});
+    Delta second = localSave("a:b", "k", {2});
+    Delta changed = echo(first, 20);
+    changed.blob = {99};
+    deliver({changed});
+    EXPECT_EQ(std::make_pair(1, std::vector<unsigned char>{2}), object("a:b", "k"));  // second still queued
+    deliver({echo(second, 21)});
+    EXPECT_EQ(std::make_pair(3, std::vector<unsigned char>{2}), object("a:b", "k"));
+    EXPECT_TRUE(deltaQueueStorage->getAllDeltas().empty());
+    EXPECT_EQ(21u, subscriptionManager->getSequenceNumber("a:b"));
+
+    collectionStorage->updateObjectStatus("a:b", "k", ObjectStatus::SENT);
+    deliver({echo(second, 22)});  // row already gone: no recomputation, number still stored
+    EXPECT_EQ(2, object("a:b", "k").first);
+    EXPECT_EQ(22u, subscriptionManager->getSequenceNumber("a:b"));
+    EXPECT_EQ(Status::PERSISTED, receivedDeltas().back().status);
+}
+
+TEST_F(DeltaHandlerTest, StatusFollowsLeastAdvancedQueuedDelta) {
+    Delta older = localSave("a:b", "k");
+    Delta newer = localSave("a:b", "k");
+    report(older, Status::SENT);
+    EXPECT_EQ(1, object("a:b", "k").first);
+    report(older, Status::PERSISTED);
+    EXPECT_EQ(1, object("a:b", "k").first);
+    report(newer, Status::SENT);
+    EXPECT_EQ(2, object("a:b", "k").first);
+    report(newer, Status::PERSISTED);
+    EXPECT_EQ(3, object("a:b", "k").first);
+    std::vector<Status> statuses;
+    for (const auto& d : receivedDeltas()) statuses.push_back(d.status);
+    EXPECT_EQ((std::vector<Status>{Status::PENDING, Status::PENDING, Status::SENT, Status::PERSISTED, Status::SENT,
+                                   Status::PERSISTED}),
+              statuses);
+}
+
+TEST_F(DeltaHandlerTest, PersistedReportAndEchoInEitherOrderEndPersisted) {
+    Delta reportedFirst = localSave("a:b", "r");
+    report(reportedFirst, Status::PERSISTED);
+    deliver({echo(reportedFirst, 1)});
+    EXPECT_EQ(3, object("a:b", "r").first);
+    EXPECT_EQ(3u, receivedDeltas().size());  // PENDING, PERSISTED (status), PERSISTED (echo)
+
+    Delta echoedFirst = localSave("a:b", "e");
+    deliver({echo(echoedFirst, 2)});
+    report(echoedFirst, Status::PERSISTED);  // finds no row: reaches nobody
+    EXPECT_EQ(3, object("a:b", "e").first);
+    EXPECT_EQ(5u, receivedDeltas().size());
+}
+
+TEST_F(DeltaHandlerTest, StatusOfLocallyDeletedObjectWritesNoRowButIsReported) {
+    localSave("a:b", "k");
+    Delta remove;
+    remove.collectionName = "a:b";
+    remove.versionId = collectionStorage->incrementAndGetVersionId("a:b");
+    remove.type = ts::SyncProtocol::DeltaType::DELETE;
+    remove.primaryKey = "k";
+    deltaHandler->addLocalDelta(remove);
+    report(remove, Status::SENT);
+    EXPECT_EQ(0, object("a:b", "k").first);
+    EXPECT_EQ(Status::SENT, receivedDeltas().back().status);
+    EXPECT_EQ(ts::SyncProtocol::DeltaType::DELETE, receivedDeltas().back().type);
+}
+
+TEST_F(DeltaHandlerTest, FailingDeliveryAppliesNothingAndIsRetriedWhole) {
+    LogCapture log;
+    transport->onDeltaReceived({remoteSave("a:b", "k1", 5), remoteSave("x:y", "k2", 6)});  // x:y has no table yet
+    ASSERT_TRUE(waitUntil([&] { return !log.linesStartingWith("Failed to process received deltas: no such table").empty(); }));
+    EXPECT_EQ(0, object("a:b", "k1").first);
+    EXPECT_TRUE(receivedDeltas().empty());
+    collectionStorage->ensureTableExistsForCollection("x:y");
+    drainJobs();
+    EXPECT_EQ(3, object("a:b", "k1").first);
+    EXPECT_EQ(3, object("x:y", "k2").first);
+    EXPECT_EQ(2u, receivedDeltas().size());  // one callback batch, after the successful attempt
+
+    deliver({});
+    EXPECT_EQ(2u, receivedDeltas().size());
+}
+
+TEST_F(DeltaHandlerTest, StoppedHandlerRefusesWritesAndDropsEvents) {
+    lifecycle->stop();
+    uint64_t before = versionIdGenerator->queryVersionId("a:b");
+    try {
+        localSave("a:b", "k");
+        FAIL();
+    } catch (const std::runtime_error& e) {
+        EXPECT_STREQ("DeltaHandler already stopped", e.what());
+    }
+    EXPECT_EQ(before + 1, versionIdGenerator->queryVersionId("a:b"));  // the id is used up
+    deliver({remoteSave("a:b", "k", 1)});
+    EXPECT_EQ(0, object("a:b", "k").first);
+    EXPECT_TRUE(receivedDeltas().empty());
+}
+
+TEST_F(DeltaHandlerTest, CallbacksSurviveThrowingAndEmptyCallbacksAndBadNumbers) {
+    LogCapture log;
+    callbackManager->addDeltaReceivedCallback([](const std::vector<ts::Delta>&) { throw std::runtime_error("app bug"); });
+    callbackManager->addDeltaReceivedCallback(ts::CallbackManager::DeltaReceivedCallback());
+    int after = 0;
+    callbackManager->addDeltaReceivedCallback([&](const std::vector<ts::Delta>&) { ++after; });
+    localSave("a:b", "k");
+    EXPECT_EQ(1, after);
+    EXPECT_EQ(1u, log.linesStartingWith("Exception in delta callback: app bug").size());
+    EXPECT_EQ(2u, log.linesStartingWith("Exception in delta callback: ").size());
+
+    Delta odd = remoteSave("a:b", "k", 1);
+    odd.type = static_cast<ts::SyncProtocol::DeltaType>(9);
+    ts::Delta api = deltaHandler->convertMQTTDeltaToApiDelta(odd, static_cast<Status>(0));
+    EXPECT_EQ("k", api.primaryKey);
+    EXPECT_EQ(1u, log.linesStartingWith("Unknown delta type: 9").size());
+    EXPECT_EQ(1u, log.linesStartingWith("Unknow delta status: 0").size());
+    EXPECT_EQ(ObjectStatus::PERSISTED, deltaHandler->convToObjectStatus(static_cast<ts::DeltaQueue::PendingStatus>(7)));
+    EXPECT_EQ(1u, log.linesStartingWith("Unknown pending status: 7").size());
+
+    deliver({odd, remoteSave("a:b", "fine", 2)});  // the unknown type is dropped, the rest applied
+    EXPECT_EQ(3, object("a:b", "fine").first);
+    EXPECT_EQ(1u, log.linesStartingWith("Dropping received delta of unknown type: 9").size());
+}
+
+TEST_F(DeltaHandlerTest, ApplyingUnknownTypeIsABrokenInvariant) {
+    Delta odd = remoteSave("a:b", "k", 1);
+    odd.type = static_cast<ts::SyncProtocol::DeltaType>(5);
+    EXPECT_DEATH(deltaHandler->applyDelta(odd, ObjectStatus::PERSISTED),
+                 "Assert \\(DeltaHandler:[0-9]+\\): Unknown delta type: 5");
+}
+
+}  // namespace
