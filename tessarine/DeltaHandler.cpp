@@ -7,6 +7,7 @@
 #include "platform/Log.h"
 #include "sqlite/Database.h"
 #include "tessarine/CallbackManager.h"
+#include "tessarine/Collection.h"
 #include "tessarine/Lifecycle.h"
 #include "tessarine/SerializedJobQueue.h"
 #include "tessarine/SubscriptionManager.h"
@@ -76,15 +77,20 @@ void DeltaHandler::postJob(std::function<void()> work) {
 
 void DeltaHandler::onDeltaReceived(const std::vector<SyncProtocol::Delta>& deltas) {
     if (stopped) return;
-    // A delta of an unknown type cannot be applied; left in the delivery it
-    // would fail the job on every retry and hold up everything behind it.
+    // A delta of an unknown type, or for a collection name that no store
+    // can have (and that must never reach SQL text), cannot be applied; left
+    // in the delivery it would fail the job on every retry and hold up
+    // everything behind it.
     std::vector<SyncProtocol::Delta> applicable;
     applicable.reserve(deltas.size());
     for (const SyncProtocol::Delta& delta : deltas) {
-        if (isKnownDeltaType(delta.type)) {
-            applicable.push_back(delta);
-        } else {
+        if (!isKnownDeltaType(delta.type)) {
             lv_printLog(5, "tessarine", "Dropping received delta of unknown type: %d", static_cast<int>(delta.type));
+        } else if (!Collection::isValidCollectionName(delta.collectionName)) {
+            lv_printLog(5, "tessarine", "Dropping received delta for invalid collection name: %s",
+                        delta.collectionName.c_str());
+        } else {
+            applicable.push_back(delta);
         }
     }
     postJob([this, applicable] { processDelivery(applicable); });

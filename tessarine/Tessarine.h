@@ -1,15 +1,36 @@
 // The entry object of the library: one store per database file.
 //
-// A store keeps all its durable state in one SQLite database at a path the
-// application chooses, opened with fixed tuning (TessarineOptions) and deleted
-// again, with its "-shm" and "-wal" companions, by remove().
+//   auto store = Tessarine::open(path, transport, threadCreator);
+//   store->addDeltaReceivedCallback(...);        // before start()
+//   store->setCollectionIndexerFunction(...);    // before start()
+//   store->start();                              // the transport starts connecting
+//   auto items = store->subscribeCollection("app:Items");
+//   items->saveObject("id-1", "sort-1", bytes);
+//   ...
+//   store->remove();   // only to delete the store's files for good
 //
-// Threads: the instance takes no lock of its own; call it from application
-// threads. remove() is meant as the last call before destruction.
+// open builds every component on one SQLite connection, opened with fixed
+// tuning (TessarineOptions). The application keeps the transport and the
+// thread creator it passes in; a transport that outlives the store is safe:
+// every component removes its registrations with it when it is destroyed.
+//
+// Threads: the instance takes no lock; call it from application threads,
+// never from the store's worker or from inside a transport delivery (its
+// destruction joins the worker and unregisters from the transport). The
+// application's callbacks run on the writing thread after a local write and
+// on the worker thread for everything that arrives through the transport.
+//
+// Errors: open and subscribeCollection log failures at priority 6 and return
+// an empty pointer; they never throw.
 #pragma once
 
 #include <memory>
 #include <string>
+
+#include "tessarine/CallbackManager.h"
+#include "tessarine/Collection.h"
+#include "tessarine/SyncProtocol.h"
+#include "tessarine/ThreadCreator.h"
 
 namespace lumivale {
 namespace sqlite {
@@ -18,7 +39,16 @@ class Database;
 
 namespace tessarine {
 
+class DeltaHandler;
+class DeltaQueue;
+class DeltaQueueStorage;
 class Lifecycle;
+class SnapshotConsumer;
+class SnapshotGenerator;
+class SubscriptionManager;
+class SubscriptionStorage;
+class VersionIdGenerator;
+class VersionVectorStorage;
 
 // The pragmas a store database is opened with. The defaults are the store's
 // fixed tuning; applications do not choose other values.
@@ -31,10 +61,33 @@ struct TessarineOptions {
 
 class Tessarine {
 public:
-    Tessarine(std::shared_ptr<lumivale::sqlite::Database> database, const std::string& path);
+    // Opens (or creates) the store at path. Empty on failure, after logging
+    // "Error while creating tessarine instance: <reason>".
+    static std::unique_ptr<Tessarine> open(const std::string& path, std::shared_ptr<SyncProtocol> syncProtocol,
+                                           std::shared_ptr<ThreadCreator> threadCreator) noexcept;
+
+    // Builds every component in order on the given storages (open does this
+    // for you). Throws when a component cannot be built or a pointer is null.
+    Tessarine(std::shared_ptr<SyncProtocol> syncProtocol, std::shared_ptr<ThreadCreator> threadCreator,
+              std::shared_ptr<lumivale::sqlite::Database> database,
+              std::shared_ptr<VersionVectorStorage> versionVectorStorage,
+              std::shared_ptr<SubscriptionStorage> subscriptionStorage,
+              std::shared_ptr<DeltaQueueStorage> deltaQueueStorage, const std::string& path);
     ~Tessarine();
     Tessarine(const Tessarine&) = delete;
     Tessarine& operator=(const Tessarine&) = delete;
+
+    // Starts the transport; from then on its events reach the store.
+    void start() noexcept;
+
+    // A new handle on the collection, subscribing to it (and creating its
+    // tables) if needed. Empty, with a log line, for an invalid name or on
+    // failure. Every call makes a new handle on the same tables.
+    std::unique_ptr<Collection> subscribeCollection(const std::string& collectionName) noexcept;
+
+    // Register before start(); registering later is safe too.
+    void addDeltaReceivedCallback(const CallbackManager::DeltaReceivedCallback& callback) noexcept;
+    void setCollectionIndexerFunction(const CallbackManager::CollectionIndexerFunction& indexer) noexcept;
 
     // Opens (creating if needed) the database at path with flags read-write |
     // create and issues the four pragmas of options, in the order temp_store,
@@ -46,16 +99,29 @@ public:
     // True when the path can be opened for reading.
     static bool fileExists(const std::string& path);
 
-    // Stops the store's lifecycle, drops this instance's reference to the
-    // database and deletes the database file, then its "-shm" and "-wal"
-    // files, skipping those that do not exist. Returns false at the first
-    // existing file that cannot be deleted, leaving the rest untouched; true
-    // otherwise, and always for "" and ":memory:". Logs nothing.
+    // Stops the store (local writes are refused from now on, transport
+    // events ignored), drops this instance's reference to the database and
+    // deletes the database file, then its "-shm" and "-wal" files, skipping
+    // those that do not exist. Returns false at the first existing file that
+    // cannot be deleted, leaving the rest; true otherwise, and always for ""
+    // and ":memory:". Meant as the last call before destruction.
     bool remove();
 
 private:
+    std::shared_ptr<SyncProtocol> syncProtocol;
+    std::shared_ptr<ThreadCreator> threadCreator;
     std::shared_ptr<lumivale::sqlite::Database> database;
+    std::shared_ptr<VersionVectorStorage> versionVectorStorage;
+    std::shared_ptr<SubscriptionManager> subscriptionManager;
+    std::shared_ptr<VersionIdGenerator> versionIdGenerator;
+    std::shared_ptr<CollectionStorage> collectionStorage;
+    std::shared_ptr<CallbackManager> callbackManager;
+    std::shared_ptr<DeltaHandler> deltaHandler;
+    std::shared_ptr<DeltaQueue> deltaQueue;
     std::shared_ptr<Lifecycle> lifecycle;
+    std::shared_ptr<SnapshotGenerator> snapshotGenerator;
+    std::shared_ptr<SnapshotConsumer> snapshotConsumer;
+    std::string clientId;
     std::string path;
 };
 

@@ -2,10 +2,14 @@
 
 #include <fstream>
 
+#include "FakeTransport.h"
 #include "TestSupport.h"
 #include "sqlite/Database.h"
 #include "sqlite/SQLiteException.h"
+#include "tessarine/DeltaQueueStorage.h"
+#include "tessarine/SubscriptionStorage.h"
 #include "tessarine/Tessarine.h"
+#include "tessarine/VersionVectorStorage.h"
 
 using lumivale::sqlite::Database;
 using lumivale::sqlite::SQLiteException;
@@ -47,30 +51,51 @@ TEST(StoreDatabaseTest, OpeningFailuresThrow) {
     EXPECT_THROW(Tessarine::createSqliteDatabase(dir.file("bad.db"), bad), SQLiteException);
 }
 
+namespace {
+
+// A store whose file walk uses path while its tables live in db, so that the
+// walk can be tested on files that are not databases.
+std::unique_ptr<Tessarine> storeOver(std::shared_ptr<Database> db, const std::string& path) {
+    return std::make_unique<Tessarine>(std::make_shared<testsupport::FakeTransport>(),
+                                       std::make_shared<testsupport::CountingThreadCreator>(), db,
+                                       std::make_shared<lumivale::tessarine::VersionVectorStorage>(db),
+                                       std::make_shared<lumivale::tessarine::SubscriptionStorage>(db),
+                                       std::make_shared<lumivale::tessarine::DeltaQueueStorage>(db), path);
+}
+
+std::unique_ptr<Tessarine> openStore(const std::string& path) {
+    return Tessarine::open(path, std::make_shared<testsupport::FakeTransport>(),
+                           std::make_shared<testsupport::CountingThreadCreator>());
+}
+
+}  // namespace
+
 TEST(StoreDatabaseTest, RemoveWithoutFilesReturnsTrue) {
     for (const std::string path : {"", ":memory:"}) {
-        Tessarine store(Tessarine::createSqliteDatabase(path, TessarineOptions()), path);
-        EXPECT_TRUE(store.remove());
-        EXPECT_TRUE(store.remove());
+        auto store = openStore(path);
+        ASSERT_TRUE(store);
+        EXPECT_TRUE(store->remove());
+        EXPECT_TRUE(store->remove());
     }
 }
 
-TEST(StoreDatabaseTest, RemoveDeletesDatabaseAndCompanionsWhileOthersHoldTheConnection) {
+TEST(StoreDatabaseTest, RemoveStopsTheStoreAndDeletesDatabaseAndCompanions) {
     testsupport::TempDir dir;
     const std::string path = dir.file("store.db");
-    auto db = Tessarine::createSqliteDatabase(path, TessarineOptions());
-    db->exec("CREATE TABLE t (x)");
-    db->exec("INSERT INTO t VALUES (1)");
-    std::shared_ptr<Database> component = db;  // as the store's components do
+    auto store = openStore(path);
+    auto items = store->subscribeCollection("app:items");
+    ASSERT_TRUE(items->saveObject("k", "s", std::vector<unsigned char>{1}));
     ASSERT_TRUE(Tessarine::fileExists(path + "-wal"));
     ASSERT_TRUE(Tessarine::fileExists(path + "-shm"));
 
-    Tessarine store(std::move(db), path);
-    EXPECT_TRUE(store.remove());
+    EXPECT_TRUE(store->remove());
     EXPECT_FALSE(Tessarine::fileExists(path));
     EXPECT_FALSE(Tessarine::fileExists(path + "-wal"));
     EXPECT_FALSE(Tessarine::fileExists(path + "-shm"));
-    EXPECT_TRUE(store.remove());  // nothing left to delete
+    testsupport::LogCapture log;
+    EXPECT_FALSE(items->saveObject("k2", "s", std::vector<unsigned char>{2}));
+    EXPECT_EQ(1u, log.linesStartingWith("Error while updating object: DeltaHandler already stopped").size());
+    EXPECT_TRUE(store->remove());  // nothing left to delete
 }
 
 TEST(StoreDatabaseTest, RemoveWithoutCompanionFilesDeletesOnlyTheDatabase) {
@@ -79,8 +104,7 @@ TEST(StoreDatabaseTest, RemoveWithoutCompanionFilesDeletesOnlyTheDatabase) {
     Database(path, 6).exec("CREATE TABLE t (x)");  // closed again: no -wal, no -shm
     ASSERT_TRUE(Tessarine::fileExists(path));
     ASSERT_FALSE(Tessarine::fileExists(path + "-wal"));
-    Tessarine store(std::make_shared<Database>(":memory:", 6), path);
-    EXPECT_TRUE(store.remove());
+    EXPECT_TRUE(storeOver(std::make_shared<Database>(":memory:", 6), path)->remove());
     EXPECT_FALSE(Tessarine::fileExists(path));
 }
 
@@ -92,8 +116,7 @@ TEST(StoreDatabaseTest, RemoveStopsAtDatabaseThatCannotBeDeleted) {
     touch(path + "/keeps-it-non-empty");
     touch(path + "-shm");
     touch(path + "-wal");
-    Tessarine store(std::make_shared<Database>(":memory:", 6), path);
-    EXPECT_FALSE(store.remove());
+    EXPECT_FALSE(storeOver(std::make_shared<Database>(":memory:", 6), path)->remove());
     EXPECT_TRUE(Tessarine::fileExists(path + "-shm"));
     EXPECT_TRUE(Tessarine::fileExists(path + "-wal"));
     EXPECT_FALSE(Tessarine::fileExists(dir.file("never-created")));

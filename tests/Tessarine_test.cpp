@@ -1,0 +1,104 @@
+#include <gtest/gtest.h>
+
+#include <fstream>
+
+#include "StoreTestSupport.h"
+
+namespace {
+
+using lumivale::tessarine::Tessarine;
+using testsupport::LogCapture;
+using testsupport::StoreUnderTest;
+using testsupport::TempDir;
+
+TEST(TessarineTest, OpenFailuresGiveEmptyStoreAndOneLogLine) {
+    TempDir dir;
+    LogCapture log;
+    EXPECT_FALSE(StoreUnderTest(dir.file("missing/store.db")).store);
+    EXPECT_FALSE(Tessarine::open(dir.file("a.db"), nullptr, std::make_shared<testsupport::CountingThreadCreator>()));
+    const std::string notADatabase = dir.file("text.db");
+    std::ofstream(notADatabase) << "this is not a database file, just some text that is long enough";
+    EXPECT_FALSE(StoreUnderTest(notADatabase).store);
+    EXPECT_EQ(3u, log.linesStartingWith("Error while creating tessarine instance: ").size());
+    std::ifstream in(notADatabase);
+    EXPECT_EQ("this", std::string(std::istreambuf_iterator<char>(in), {}).substr(0, 4));  // untouched
+}
+
+TEST(TessarineTest, StartAndInvalidNamesAndIdentityAcrossReopen) {
+    TempDir dir;
+    StoreUnderTest first(dir.file("one.db"));
+    EXPECT_EQ(0, first.transport->starts.load());
+    EXPECT_EQ(1, first.threadCreator->created.load());
+    first.store->start();
+    EXPECT_EQ(1, first.transport->starts.load());
+
+    LogCapture log;
+    EXPECT_FALSE(first.store->subscribeCollection("not valid"));
+    EXPECT_EQ(1u, log.linesStartingWith("Error subscribing to a collection: Invalid collection name.").size());
+    EXPECT_TRUE(first.transport->sentEvents().empty());
+
+    ASSERT_TRUE(first.store->subscribeCollection("app:items"));
+    std::string id = first.transport->sentSubscriptions().at(0).clientId;
+    StoreUnderTest second(dir.file("two.db"));
+    second.store->subscribeCollection("app:items");
+    EXPECT_NE(id, second.transport->sentSubscriptions().at(0).clientId);
+    first.store.reset();
+    StoreUnderTest reopened(dir.file("one.db"));
+    reopened.store->subscribeCollection("app:items");
+    EXPECT_EQ(id, reopened.transport->sentSubscriptions().at(0).clientId);
+}
+
+TEST(TessarineTest, ConnectionResubscribesBeforeResendingAcrossRestart) {
+    TempDir dir;
+    {
+        StoreUnderTest s(dir.file("store.db"));
+        auto items = s.store->subscribeCollection("app:items");
+        items->saveObject("k", "s", std::vector<unsigned char>{1});
+        items->saveObject("j", "s", std::vector<unsigned char>{2});
+    }
+    StoreUnderTest s(dir.file("store.db"));
+    s.transport->onConnectionEstablished();
+    EXPECT_EQ((std::vector<std::string>{"subscribe app:items", "delta app:items/1", "delta app:items/2"}),
+              s.transport->sentEvents());
+}
+
+TEST(TessarineTest, HandleOutlivesStoreAndTransportOutlivesBoth) {
+    TempDir dir;
+    StoreUnderTest s(dir.file("store.db"));
+    std::vector<std::string> heard;
+    std::mutex heardMutex;
+    s.store->addDeltaReceivedCallback([&](const std::vector<lumivale::tessarine::Delta>& deltas) {
+        std::lock_guard<std::mutex> lock(heardMutex);
+        for (const auto& d : deltas) heard.push_back(d.primaryKey);
+    });
+    auto items = s.store->subscribeCollection("app:items");
+    s.store.reset();
+
+    // The handle keeps the components, the connection and the worker alive.
+    EXPECT_TRUE(items->saveObject("local", "s", std::vector<unsigned char>{1}));
+    lumivale::tessarine::SyncProtocol::Delta remote;
+    remote.clientId = "SOMEONE";
+    remote.collectionName = "app:items";
+    remote.primaryKey = "remote";
+    remote.sequenceNumber = 1;
+    s.transport->onDeltaReceived({remote});
+    ASSERT_TRUE(testsupport::waitUntil([&] {
+        std::lock_guard<std::mutex> lock(heardMutex);
+        return heard.size() == 2;
+    }));
+    EXPECT_EQ(2u, testsupport::rows(items->query("", -1, lumivale::tessarine::CollectionStorage::SortDirection::ASCENDING))
+                      .size());
+
+    items.reset();
+    s.transport->clearSent();
+    s.transport->onConnectionEstablished();
+    s.transport->onDeltaReceived({remote});
+    s.transport->onDeltaStatusUpdated({remote, lumivale::tessarine::SyncProtocol::DeltaStatus::SENT});
+    s.transport->onSnapshotReceived({});
+    s.transport->onSubscriptionResponseReceived({});
+    EXPECT_TRUE(s.transport->sentEvents().empty());
+    std::lock_guard<std::mutex> lock(heardMutex);
+    EXPECT_EQ(2u, heard.size());
+}
+
+}  // namespace
