@@ -47,6 +47,11 @@ void Database::exec(const std::string& sql) {
     connection->exec(sql);
 }
 
+bool Database::isReadOnly() const {
+    std::lock_guard<std::recursive_mutex> lock(connection->mutex());
+    return sqlite3_db_readonly(connection->handle(), "main") == 1;
+}
+
 Statement Database::prepare(const std::string& sql) {
     std::lock_guard<std::recursive_mutex> lock(connection->mutex());
     sqlite3_stmt* statement = nullptr;

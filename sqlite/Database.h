@@ -47,6 +47,11 @@ public:
     // Runs one SQL statement to completion; rows it returns are discarded.
     void exec(const std::string& sql);
 
+    // True when SQLite opened the main database for reading only, which it
+    // does without an error when a read-write open meets a file that cannot
+    // be written.
+    bool isReadOnly() const;
+
     // Compiles one statement with ? placeholders.
     Statement prepare(const std::string& sql);
 
