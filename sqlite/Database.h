@@ -52,7 +52,9 @@ public:
     // be written.
     bool isReadOnly() const;
 
-    // Compiles one statement with ? placeholders.
+    // Compiles one statement with ? placeholders. Text without a statement,
+    // or with anything but blanks, comments and semicolons after the first
+    // one, throws instead of being cut silently.
     Statement prepare(const std::string& sql);
 
     // Begins a transaction of the given type, runs fn and commits. If fn
