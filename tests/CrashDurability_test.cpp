@@ -32,7 +32,7 @@ using testsupport::Journal;
 using testsupport::JournalWrite;
 
 #ifdef TESSARINE_TEST_SANITIZED
-constexpr int kCycles = 15;  // every process runs several times slower
+constexpr int kCycles = 30;  // every process runs several times slower
 #else
 constexpr int kCycles = 60;
 #endif
