@@ -4,6 +4,10 @@
 // same transport. The queue is not changed by a resend, so every iteration
 // sends the whole queue again.
 //
+// resend/floor_read_first is the floor read the way the store's queue is
+// read by design: the whole queue into a vector first, then sent; it tells
+// the cost of that structure from the store's own overhead.
+//
 // resend_memory/<side>/100000 resends a queue of 100 000 once and reports
 // how far that raised the process's peak resident memory (counter
 // "rss_growth_kib"); scripts/bench.sh runs each side in a process of its own.
@@ -50,8 +54,10 @@ void resendOurs(OpenStore& store, uint64_t queued) {
 // client id.
 class FloorResend {
 public:
-    FloorResend(RawDatabase& database, CountingTransport& transport, bool prepareEachUse)
+    FloorResend(RawDatabase& database, CountingTransport& transport, bool prepareEachUse,
+                bool readWholeQueueFirst = false)
         : transport(transport),
+          readWholeQueueFirst(readWholeQueueFirst),
           subscriptions(database, sql::kGetSubscriptions, prepareEachUse),
           metadata(database, sql::kGetMetadata, prepareEachUse),
           allDeltas(database, sql::kGetAllDeltas, prepareEachUse) {}
@@ -72,6 +78,7 @@ public:
         std::string clientId = readMetadata("client_id").columnText(0);
         metadata.done();
         allDeltas.start();
+        std::vector<std::pair<SyncProtocol::Delta, SyncProtocol::DeltaStatus>> queue;
         while (allDeltas.step()) {
             SyncProtocol::Delta delta;
             delta.clientId = clientId;
@@ -82,9 +89,15 @@ public:
             delta.sortKey = allDeltas.columnText(4);
             auto bytes = allDeltas.columnBlob(5);
             delta.blob.assign(bytes.first, bytes.first + bytes.second);
-            transport.sendDelta(delta);
+            if (readWholeQueueFirst) {
+                auto status = static_cast<SyncProtocol::DeltaStatus>(allDeltas.columnInt64(6));
+                queue.emplace_back(std::move(delta), status);
+            } else {
+                transport.sendDelta(delta);
+            }
         }
         allDeltas.done();
+        for (const auto& entry : queue) transport.sendDelta(entry.first);
     }
 
 private:
@@ -95,6 +108,7 @@ private:
     }
 
     CountingTransport& transport;
+    bool readWholeQueueFirst;
     RawStatement subscriptions;
     RawStatement metadata;
     RawStatement allDeltas;
@@ -112,17 +126,17 @@ void ours(benchmark::State& state) {
     setOpsPerIteration(state, 1);
 }
 
-void floorSide(benchmark::State& state, bool prepareEachUse) {
+void floorSide(benchmark::State& state, bool prepareEachUse, bool readWholeQueueFirst = false) {
     Environment& env = environment(kQueued);
     FloorResend floor(prepareEachUse ? env.floorPrepareDatabase : env.floorDatabase, *env.ours->transport,
-                      prepareEachUse);
+                      prepareEachUse, readWholeQueueFirst);
     for (auto _ : state) resendFloor(floor, *env.ours->transport, kQueued);
     setOpsPerIteration(state, 1);
 }
 
-void memory(benchmark::State& state, bool useStore) {
+void memory(benchmark::State& state, bool useStore, bool readWholeQueueFirst = false) {
     Environment& env = environment(kQueuedForMemory);
-    FloorResend floor(env.floorDatabase, *env.ours->transport, false);
+    FloorResend floor(env.floorDatabase, *env.ours->transport, false, readWholeQueueFirst);
     long before = peakRssKiB();
     for (auto _ : state) {
         if (useStore) {
@@ -139,8 +153,11 @@ const bool registered = [] {
     add("resend/ours", ours)->Iterations(20);
     add("resend/floor", [](benchmark::State& s) { floorSide(s, false); })->Iterations(20);
     add("resend/floor_prepare", [](benchmark::State& s) { floorSide(s, true); })->Iterations(20);
+    add("resend/floor_read_first", [](benchmark::State& s) { floorSide(s, false, true); })->Iterations(20);
     add("resend_memory/ours/100000", [](benchmark::State& s) { memory(s, true); })->Iterations(1);
     add("resend_memory/floor/100000", [](benchmark::State& s) { memory(s, false); })->Iterations(1);
+    add("resend_memory/floor_read_first/100000", [](benchmark::State& s) { memory(s, false, true); })
+        ->Iterations(1);
     return true;
 }();
 

@@ -49,5 +49,7 @@ run scale scale_bench
 # its own so that neither's peak hides the other's.
 run resend_memory_ours resend_bench --benchmark_filter='^resend_memory/ours/' --benchmark_repetitions=1
 run resend_memory_floor resend_bench --benchmark_filter='^resend_memory/floor/' --benchmark_repetitions=1
+run resend_memory_floor_read_first resend_bench --benchmark_filter='^resend_memory/floor_read_first/' \
+  --benchmark_repetitions=1
 
 python3 "$repo_root/scripts/bench_table.py" "$results"

@@ -97,6 +97,10 @@ def main():
         rows.append([label, show_time(ours), show_time(floor), ratio(ours, floor), show_time(prepared),
                      ratio(ours, prepared)])
     table(rows, ["operation", "ours", "floor", "ratio", "floor, prepared anew", "ours / that"])
+    for (operation, size), sides in figures.items():
+        for side, seconds in sides.items():
+            if side not in ("ours", "floor", "floor_prepare") and operation in LABELS:
+                print(f"{operation} {side}: {show_time(seconds)}, ours / that {ratio(sides.get('ours'), seconds)}")
 
     print()
     for operation, what in (("scale_save", "save"), ("scale_range_query", "range query row")):
@@ -112,7 +116,7 @@ def main():
                    if not label.startswith("resend_memory")]
     table(memory_rows, ["program", "peak resident memory"])
     print()
-    for side in ("ours", "floor"):
+    for side in ("ours", "floor", "floor_read_first"):
         entry = counters.get(("resend_memory", side, 100000))
         peak = peaks.get(f"resend_memory_{side}")
         if entry and peak:
