@@ -5,7 +5,9 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
+#include <ctime>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -358,7 +360,23 @@ long peakRssKiB() {
     return usage.ru_maxrss;  // KiB on Linux
 }
 
-void setOpsPerIteration(benchmark::State& state, double ops) { state.counters["ops"] = ops; }
+namespace {
+double processCpuSeconds() {
+    timespec now{};
+    clock_gettime(CLOCK_PROCESS_CPUTIME_ID, &now);
+    return static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) * 1e-9;
+}
+}  // namespace
+
+CpuMeter::CpuMeter() : start(processCpuSeconds()) {}
+
+double CpuMeter::seconds() const { return processCpuSeconds() - start; }
+
+void report(benchmark::State& state, double opsPerIteration, const CpuMeter& cpu) {
+    double iterations = static_cast<double>(std::max<benchmark::IterationCount>(state.iterations(), 1));
+    state.counters["ops"] = opsPerIteration;
+    state.counters["cpu_s"] = cpu.seconds() / iterations;
+}
 
 namespace {
 std::vector<std::function<void()>>& teardowns() {

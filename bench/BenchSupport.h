@@ -7,8 +7,8 @@
 // each statement prepared anew ("floor_prepare"), which is what the store
 // does by rule, so the cost of that rule can be read off. Benchmarks are
 // named "<operation>/<side>" (plus "/<size>" where a size applies) and set the
-// counter "ops" to the operations one iteration performs; scripts/bench.sh
-// divides by it.
+// counters "ops" (operations per iteration; scripts/bench.sh divides by it)
+// and "cpu_s" (process CPU time per iteration).
 //
 // Threads: everything here is used from the benchmark's thread, except the
 // transport and the callback counter, which the store's worker also calls.
@@ -208,8 +208,21 @@ struct OpenStore {
 // Peak resident memory of this process so far, in KiB.
 long peakRssKiB();
 
-// Sets the per-iteration operation count that scripts/bench.sh divides by.
-void setOpsPerIteration(benchmark::State& state, double ops);
+// CPU time of the whole process (the store's worker included) from
+// construction on. Other work on a shared machine disturbs it far less than
+// wall-clock time, so scripts/bench.sh reports ratios of both.
+class CpuMeter {
+public:
+    CpuMeter();
+    double seconds() const;
+
+private:
+    double start;
+};
+
+// Sets the counters scripts/bench.sh reads: "ops", the operations one
+// iteration performs, and "cpu_s", process CPU seconds per iteration.
+void report(benchmark::State& state, double opsPerIteration, const CpuMeter& cpu);
 
 // Registers work to run after the benchmarks and before the peak memory is
 // printed (closing stores, removing files).

@@ -24,6 +24,7 @@ std::unique_ptr<Environment> environment;
 
 void ours(benchmark::State& state) {
     Environment& env = lazily(environment);
+    const CpuMeter cpu;
     for (auto _ : state) {
         uint64_t i = env.nextOurs++;
         if (!env.ours->collection->saveObject(primaryKey(i), sortKey(i), blob(i))) {
@@ -31,18 +32,19 @@ void ours(benchmark::State& state) {
             break;
         }
     }
-    setOpsPerIteration(state, 1);
+    report(state, 1, cpu);
 }
 
 void floorSide(benchmark::State& state, bool prepareEachUse) {
     Environment& env = lazily(environment);
     FloorWrites& floor = prepareEachUse ? env.floorPrepare : env.floor;
     uint64_t& next = prepareEachUse ? env.nextFloorPrepare : env.nextFloor;
+    const CpuMeter cpu;
     for (auto _ : state) {
         uint64_t i = next++;
         floor.save(primaryKey(i), sortKey(i), blob(i));
     }
-    setOpsPerIteration(state, 1);
+    report(state, 1, cpu);
 }
 
 const bool registered = [] {

@@ -69,9 +69,10 @@ void measure(benchmark::State& state, const std::function<size_t(uint64_t)>& que
     lazily(environment);  // built before the clock runs
     size_t rows = 0;
     uint64_t k = 0;
+    const CpuMeter cpu;
     for (auto _ : state) rows += query(mix(k++));
     if (rows == 0) throw std::runtime_error("no rows read");
-    setOpsPerIteration(state, static_cast<double>(rows) / static_cast<double>(state.iterations()));
+    report(state, static_cast<double>(rows) / static_cast<double>(state.iterations()), cpu);
 }
 
 lumivale::tessarine::Collection& collection() { return *lazily(environment).ours->collection; }

@@ -44,6 +44,7 @@ std::vector<SyncProtocol::Delta> delivery(uint64_t first) {
 void ours(benchmark::State& state) {
     Environment& env = lazily(environment);
     OpenStore& store = *env.ours;
+    const CpuMeter cpu;
     for (auto _ : state) {
         state.PauseTiming();
         std::vector<SyncProtocol::Delta> deltas = delivery(env.nextOurs);
@@ -56,13 +57,14 @@ void ours(benchmark::State& state) {
             break;
         }
     }
-    setOpsPerIteration(state, kDeltasPerDelivery);
+    report(state, kDeltasPerDelivery, cpu);
 }
 
 void floorSide(benchmark::State& state, bool prepareEachUse) {
     Environment& env = lazily(environment);
     FloorWrites& floor = prepareEachUse ? env.floorPrepare : env.floor;
     uint64_t& next = prepareEachUse ? env.nextFloorPrepare : env.nextFloor;
+    const CpuMeter cpu;
     for (auto _ : state) {
         state.PauseTiming();
         std::vector<SyncProtocol::Delta> deltas = delivery(next);
@@ -70,7 +72,7 @@ void floorSide(benchmark::State& state, bool prepareEachUse) {
         state.ResumeTiming();
         floor.applyRemote(deltas);
     }
-    setOpsPerIteration(state, kDeltasPerDelivery);
+    report(state, kDeltasPerDelivery, cpu);
 }
 
 const bool registered = [] {

@@ -122,22 +122,25 @@ void resendFloor(FloorResend& floor, CountingTransport& transport, uint64_t queu
 
 void ours(benchmark::State& state) {
     Environment& env = environment(kQueued);
+    const CpuMeter cpu;
     for (auto _ : state) resendOurs(*env.ours, kQueued);
-    setOpsPerIteration(state, 1);
+    report(state, 1, cpu);
 }
 
 void floorSide(benchmark::State& state, bool prepareEachUse, bool readWholeQueueFirst = false) {
     Environment& env = environment(kQueued);
     FloorResend floor(prepareEachUse ? env.floorPrepareDatabase : env.floorDatabase, *env.ours->transport,
                       prepareEachUse, readWholeQueueFirst);
+    const CpuMeter cpu;
     for (auto _ : state) resendFloor(floor, *env.ours->transport, kQueued);
-    setOpsPerIteration(state, 1);
+    report(state, 1, cpu);
 }
 
 void memory(benchmark::State& state, bool useStore, bool readWholeQueueFirst = false) {
     Environment& env = environment(kQueuedForMemory);
     FloorResend floor(env.floorDatabase, *env.ours->transport, false, readWholeQueueFirst);
     long before = peakRssKiB();
+    const CpuMeter cpu;
     for (auto _ : state) {
         if (useStore) {
             resendOurs(*env.ours, kQueuedForMemory);
@@ -146,7 +149,7 @@ void memory(benchmark::State& state, bool useStore, bool readWholeQueueFirst = f
         }
     }
     state.counters["rss_growth_kib"] = static_cast<double>(peakRssKiB() - before);
-    setOpsPerIteration(state, 1);
+    report(state, 1, cpu);
 }
 
 const bool registered = [] {

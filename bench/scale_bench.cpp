@@ -45,6 +45,7 @@ Environment& environment(const benchmark::State& state) {
 
 void saveOurs(benchmark::State& state) {
     Environment& env = environment(state);
+    const CpuMeter cpu;
     for (auto _ : state) {
         uint64_t generation = ++env.oursGeneration;
         uint64_t i = mix(generation) % env.objects;
@@ -53,22 +54,24 @@ void saveOurs(benchmark::State& state) {
             break;
         }
     }
-    setOpsPerIteration(state, 1);
+    report(state, 1, cpu);
 }
 
 void saveFloor(benchmark::State& state) {
     Environment& env = environment(state);
+    const CpuMeter cpu;
     for (auto _ : state) {
         uint64_t generation = ++env.floorGeneration;
         uint64_t i = mix(generation) % env.objects;
         env.floor.save(primaryKey(i), sortKey(i), blob(i, generation));
     }
-    setOpsPerIteration(state, 1);
+    report(state, 1, cpu);
 }
 
 void queryOurs(benchmark::State& state) {
     Environment& env = environment(state);
     uint64_t rows = 0, k = 0;
+    const CpuMeter cpu;
     for (auto _ : state) {
         auto cursor = env.ours->collection->query(sortKey(mix(k++) % (env.objects - kRangeRows)), kRangeRows,
                                                   CollectionStorage::SortDirection::ASCENDING);
@@ -83,13 +86,14 @@ void queryOurs(benchmark::State& state) {
             ++rows;
         }
     }
-    setOpsPerIteration(state, static_cast<double>(rows) / static_cast<double>(state.iterations()));
+    report(state, static_cast<double>(rows) / static_cast<double>(state.iterations()), cpu);
 }
 
 void queryFloor(benchmark::State& state) {
     Environment& env = environment(state);
     RawStatement statement(env.floorDatabase, sql::kQueryCollection);
     uint64_t rows = 0, k = 0;
+    const CpuMeter cpu;
     for (auto _ : state) {
         statement.start().bind(1, sortKey(mix(k++) % (env.objects - kRangeRows))).bind(2, kRangeRows + 0LL);
         while (statement.step()) {
@@ -103,7 +107,7 @@ void queryFloor(benchmark::State& state) {
         }
         statement.done();
     }
-    setOpsPerIteration(state, static_cast<double>(rows) / static_cast<double>(state.iterations()));
+    report(state, static_cast<double>(rows) / static_cast<double>(state.iterations()), cpu);
 }
 
 const bool registered = [] {

@@ -5,7 +5,10 @@ Reads every <label>.json (Google Benchmark output) and <label>.log (which ends
 with the program's "peak resident memory: N KiB") in the results directory.
 Benchmarks are named <operation>/<side>[/<size>]; the counter "ops" is the
 number of operations one iteration performs, so real time / ops is the cost
-of one operation. Where there are repetitions, the medians are used.
+of one operation; the counter "cpu_s" is the process's CPU time per
+iteration (the store's worker thread included), which other load on a shared
+machine disturbs far less than wall-clock time. Where there are repetitions,
+the medians are used.
 """
 import json
 import pathlib
@@ -34,8 +37,9 @@ def base_name(run_name):
 
 
 def load(results):
-    """{(operation, size): {side: seconds per op}} and extra counters."""
-    figures, counters = {}, {}
+    """{(operation, size): {side: wall seconds per op}}, the same for CPU
+    seconds, and every entry's counters."""
+    figures, cpu, counters = {}, {}, {}
     for path in sorted(results.glob("*.json")):
         data = json.loads(path.read_text())
         entries = data.get("benchmarks", [])
@@ -48,8 +52,10 @@ def load(results):
             size = int(parts[2]) if len(parts) > 2 else None
             seconds = entry["real_time"] * UNIT_SECONDS[entry["time_unit"]] / entry.get("ops", 1)
             figures.setdefault((operation, size), {})[side] = seconds
+            if "cpu_s" in entry:
+                cpu.setdefault((operation, size), {})[side] = entry["cpu_s"] / entry.get("ops", 1)
             counters[(operation, side, size)] = entry
-    return figures, counters
+    return figures, cpu, counters
 
 
 def peak_memory(results):
@@ -85,29 +91,35 @@ def table(rows, header):
 
 def main():
     results = pathlib.Path(sys.argv[1])
-    figures, counters = load(results)
+    figures, cpu, counters = load(results)
     keys = sorted(figures, key=lambda k: (ORDER.index(k[0]) if k[0] in ORDER else 99, k[1] or 0))
     rows = []
     for operation, size in keys:
         if operation not in LABELS:
             continue
-        sides = figures[(operation, size)]
+        sides, cpus = figures[(operation, size)], cpu.get((operation, size), {})
         ours, floor, prepared = sides.get("ours"), sides.get("floor"), sides.get("floor_prepare")
         label = LABELS[operation].format(size=f"{size:,}".replace(",", " ") if size else "")
-        rows.append([label, show_time(ours), show_time(floor), ratio(ours, floor), show_time(prepared),
-                     ratio(ours, prepared)])
-    table(rows, ["operation", "ours", "floor", "ratio", "floor, prepared anew", "ours / that"])
+        rows.append([label, show_time(ours), show_time(floor), ratio(ours, floor),
+                     ratio(cpus.get("ours"), cpus.get("floor")), show_time(prepared),
+                     ratio(cpus.get("ours"), cpus.get("floor_prepare"))])
+    table(rows, ["operation", "ours", "floor", "ratio", "CPU ratio", "floor, prepared anew",
+                 "ours / that, CPU"])
+    print("(times and ratio: wall clock; CPU ratio: process CPU time, the store's worker included)")
     for (operation, size), sides in figures.items():
         for side, seconds in sides.items():
             if side not in ("ours", "floor", "floor_prepare") and operation in LABELS:
-                print(f"{operation} {side}: {show_time(seconds)}, ours / that {ratio(sides.get('ours'), seconds)}")
+                cpus = cpu.get((operation, size), {})
+                print(f"{operation} {side}: {show_time(seconds)}, ours / that {ratio(sides.get('ours'), seconds)}"
+                      f" (CPU {ratio(cpus.get('ours'), cpus.get(side))})")
 
     print()
     for operation, what in (("scale_save", "save"), ("scale_range_query", "range query row")):
-        small, large = figures.get((operation, 1000), {}), figures.get((operation, 1000000), {})
-        if small.get("ours") and large.get("ours"):
-            print(f"cost per {what} at 1 000 000 objects / at 1 000: ours {ratio(large['ours'], small['ours'])}, "
-                  f"floor {ratio(large.get('floor'), small.get('floor'))}")
+        for kind, source in (("wall", figures), ("CPU", cpu)):
+            small, large = source.get((operation, 1000), {}), source.get((operation, 1000000), {})
+            if small.get("ours") and large.get("ours"):
+                print(f"cost per {what} at 1 000 000 objects / at 1 000 ({kind}): "
+                      f"ours {ratio(large['ours'], small['ours'])}, floor {ratio(large.get('floor'), small.get('floor'))}")
     print(f"targets: every ratio <= {RATIO_TARGET}; save at 1 000 000 / at 1 000 <= {SAVE_GROWTH_TARGET}")
 
     print()
