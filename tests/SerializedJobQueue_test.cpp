@@ -135,6 +135,9 @@ TEST(SerializedJobQueueTest, JobsFromSeveralThreadsRunOneAtATimeInPostingOrderOn
     EXPECT_EQ(1, creator->calls);
 }
 
+// A job queued behind the running one is not checked here: whether it starts
+// depends on whether the stopper cleared the flag before the running job
+// returned, which the test cannot observe. Jobs posted after the stop are.
 TEST(SerializedJobQueueTest, StopWaitsForTheRunningAttemptThenNothingRunsAndDestructionNeverHangs) {
     auto log = std::make_shared<Log>();
     auto queue = makeQueue();
@@ -145,7 +148,6 @@ TEST(SerializedJobQueueTest, StopWaitsForTheRunningAttemptThenNothingRunsAndDest
         released.wait();
         log->add("finished");
     }});
-    queue->addJob(job(log, "queued"));
     log->waitFor(1);
     std::thread stopper([&] {
         log->add("stopping");
