@@ -64,6 +64,10 @@ uint64_t CollectionLog::highestVersionId(const std::string& clientId) const {
     return found == highestVersionIds.end() ? 0 : found->second;
 }
 
+bool CollectionLog::hasChangesFrom(const std::string& clientId) const {
+    return highestVersionIds.count(clientId) != 0;
+}
+
 std::vector<SyncProtocol::TessarineObject> CollectionLog::objects() const {
     std::vector<SyncProtocol::TessarineObject> result;
     result.reserve(currentObjects.size());

@@ -58,6 +58,8 @@ public:
     uint64_t lastSequenceNumber() const;
     // 0 for a client none of whose changes was accepted.
     uint64_t highestVersionId(const std::string& clientId) const;
+    // True once a change of clientId has been accepted.
+    bool hasChangesFrom(const std::string& clientId) const;
     // Ascending by sort key, objects with equal sort keys by primary key.
     std::vector<SyncProtocol::TessarineObject> objects() const;
 

@@ -103,7 +103,13 @@ SyncServer::Receipt SyncServer::receiveSubscription(Session& session, const std:
     if (!session.subscriptions.insert(request.collectionName).second) {
         return receipt(Outcome::SUBSCRIBED, request.collectionName, log);
     }
-    if (request.sequenceNumber == 0 || request.sequenceNumber > log.lastSequenceNumber()) {
+    // A snapshot never deletes, so it suits only a client that holds nothing
+    // of the collection yet besides changes the server never accepted; one
+    // whose changes were accepted may hold objects deleted since, and
+    // catches up from the start instead.
+    bool holdsNothing = request.sequenceNumber == 0 && !log.hasChangesFrom(request.clientId);
+    bool numberUnknown = request.sequenceNumber > log.lastSequenceNumber();
+    if (holdsNothing || numberUnknown) {
         session.delivery(makeSnapshotPayload(log.snapshotFor(request.clientId)));
     } else {
         for (const SyncProtocol::Delta& change : log.catchUpAfter(request.sequenceNumber, request.clientId)) {

@@ -21,9 +21,12 @@
 //   - A subscription (TOPIC_SUBSCRIBE_COLLECTION) with sequence number n gets
 //     the changes after n, one delta list per change, in order, leaving out
 //     other clients' changes that a later change of the same object
-//     supersedes (CollectionLog::catchUpAfter says why); with n = 0,
-//     or with an n the server never reached (it has lost its memory since),
-//     a snapshot instead. From then on the session gets every new change of
+//     supersedes (CollectionLog::catchUpAfter says why). A snapshot instead
+//     when n = 0 and the server has accepted no change of that client in the
+//     collection (a client that had changes accepted catches up from 0: a
+//     snapshot never deletes, and objects it holds may have been deleted
+//     since), or when n is a number the server never reached (it has lost
+//     its memory since). From then on the session gets every new change of
 //     the collection. A session never gets a change twice: subscribing again
 //     to a collection it follows sends nothing, since whatever the client
 //     lacks is already on its way. (A store does not restore an object from
