@@ -20,7 +20,7 @@ export GTEST_DEATH_TEST_STYLE=threadsafe
 
 configure() {
   case "$1" in
-    plain) configure_build plain -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON ;;
+    plain) configure_build plain -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON -DTESSARINE_BUILD_BENCHMARKS=ON ;;
     asan)  configure_build asan -DCMAKE_BUILD_TYPE=Debug -DTESSARINE_WERROR=ON \
              -DTESSARINE_SANITIZE=address,undefined -DTESSARINE_PACKAGE_TEST=OFF ;;
     tsan)  configure_build tsan -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON \

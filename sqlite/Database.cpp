@@ -42,6 +42,12 @@ Database::Database(const std::string& path, int flags)
 
 Database::~Database() = default;
 
+Database::ScopedLock::ScopedLock(Database& database) : connection(database.connection) {
+    connection->mutex().lock();
+}
+
+Database::ScopedLock::~ScopedLock() { connection->mutex().unlock(); }
+
 void Database::exec(const std::string& sql) {
     std::lock_guard<std::recursive_mutex> lock(connection->mutex());
     connection->exec(sql);

@@ -37,6 +37,24 @@ public:
     // other connections out, which the store does not need.
     enum class TransactionType { Deferred = 1, Immediate = 2, Exclusive = 3 };
 
+    // Keeps other threads off the connection for as long as it lives, so that
+    // a run of calls from this thread (reading many rows, each column a call)
+    // takes the connection's lock once instead of once per call; this
+    // thread's calls go straight through meanwhile. Not a transaction:
+    // nothing is begun, committed or rolled back. The rule for transactions
+    // holds here too: do not wait for another thread that uses this database
+    // while holding it. Not copyable or movable; one thread.
+    class ScopedLock {
+    public:
+        explicit ScopedLock(Database& database);
+        ~ScopedLock();
+        ScopedLock(const ScopedLock&) = delete;
+        ScopedLock& operator=(const ScopedLock&) = delete;
+
+    private:
+        std::shared_ptr<Connection> connection;
+    };
+
     // flags are sqlite3_open_v2's (the store passes read-write | create).
     // "" and ":memory:" keep SQLite's meaning.
     Database(const std::string& path, int flags);

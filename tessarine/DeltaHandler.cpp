@@ -93,7 +93,10 @@ void DeltaHandler::onDeltaReceived(const std::vector<SyncProtocol::Delta>& delta
             applicable.push_back(delta);
         }
     }
-    postJob([this, applicable] { processDelivery(applicable); });
+    // The job queue copies a job when it queues it and again when it runs
+    // it; sharing the delivery makes those copies cheap.
+    auto delivery = std::make_shared<const std::vector<SyncProtocol::Delta>>(std::move(applicable));
+    postJob([this, delivery] { processDelivery(*delivery); });
 }
 
 void DeltaHandler::onDeltaStatusUpdated(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {

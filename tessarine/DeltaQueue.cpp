@@ -57,8 +57,12 @@ int DeltaQueue::addDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaSt
 
 int DeltaQueue::sendDelta(const SyncProtocol::Delta& delta) {
     SyncProtocol::Delta stamped = delta;
-    stamped.clientId = clientId;
-    return syncProtocol->sendDelta(stamped);
+    return stampAndSend(stamped);
+}
+
+int DeltaQueue::stampAndSend(SyncProtocol::Delta& delta) {
+    delta.clientId = clientId;
+    return syncProtocol->sendDelta(delta);
 }
 
 std::optional<SyncProtocol::DeltaStatus> DeltaQueue::getMinStatus(
@@ -139,7 +143,8 @@ void DeltaQueue::onConnectionEstablished() {
         auto deltas = deltaQueueStorage->getAllDeltas();
         lv_printLog(3, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)",
                     static_cast<unsigned>(deltas.size()));
-        for (const auto& entry : deltas) sendDelta(entry.first);
+        // The deltas read back are ours to stamp: no copy per delta.
+        for (auto& entry : deltas) stampAndSend(entry.first);
     } catch (const std::exception& e) {
         lv_printLog(6, "tessarine", "Error in DeltaQueue::onConnectionEstablished: %s", e.what());
     }

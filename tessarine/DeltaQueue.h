@@ -78,6 +78,9 @@ public:
     void onLifecycleStop();
 
 private:
+    // Stamps a delta the queue owns and hands it to the transport, sparing
+    // the copy that sendDelta makes to leave its caller's delta alone.
+    int stampAndSend(SyncProtocol::Delta& delta);
     void processDeltaStatusUpdate(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
 
     std::shared_ptr<lumivale::sqlite::Database> database;

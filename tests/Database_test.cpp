@@ -125,6 +125,40 @@ TEST_F(DatabaseTest, OtherThreadStatementWaitsForTransactionAndSurvivesItsRollba
     EXPECT_EQ(1, count());
 }
 
+// A scoped lock must let its own thread's calls through (a plain mutex would
+// deadlock here) and keep another thread's statement out until it ends,
+// without making a transaction of the calls it covers.
+TEST_F(DatabaseTest, ScopedLockLetsOwnCallsThroughAndHoldsOthersOff) {
+    std::mutex m;
+    std::condition_variable cv;
+    bool otherReady = false;
+    std::atomic<bool> otherDone{false};
+    std::thread other;
+    {
+        Database::ScopedLock lock(*db);
+        insert("mine");
+        other = std::thread([&] {
+            {
+                std::lock_guard<std::mutex> guard(m);
+                otherReady = true;
+            }
+            cv.notify_one();
+            insert("theirs");
+            otherDone = true;
+        });
+        std::unique_lock<std::mutex> guard(m);
+        cv.wait(guard, [&] { return otherReady; });
+        guard.unlock();
+        for (int i = 0; i < 300; ++i) insert("filler" + std::to_string(i));
+        EXPECT_FALSE(has("theirs"));
+        EXPECT_FALSE(otherDone.load());
+    }
+    other.join();
+    EXPECT_TRUE(has("theirs"));
+    EXPECT_TRUE(has("mine"));
+    EXPECT_EQ(302, count());
+}
+
 TEST_F(DatabaseTest, ConcurrentTransactionsAndOpenReadersAcrossThreadsStayConsistent) {
     for (int i = 0; i < 50; ++i) insert("seed" + std::to_string(i));
     constexpr int kThreads = 4;
