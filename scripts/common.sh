@@ -16,3 +16,21 @@ configure_build() {
   cmake -S "$repo_root" -B "$build_root/$name" -G Ninja -Wno-dev --log-level=WARNING \
     "${launcher[@]}" "$@" >/dev/null
 }
+
+# The cross configurations: aarch64 is Android's arm64-v8a ABI, armhf its
+# armeabi-v7a. cross_triple CONFIG prints the GNU triple (also Debian's
+# multiarch directory and the toolchain file's name, cmake/toolchains/), and
+# cross_debian_arch CONFIG the Debian architecture; both print nothing for a
+# native configuration.
+cross_triple() {
+  case "$1" in
+    aarch64) echo aarch64-linux-gnu ;;
+    armhf) echo arm-linux-gnueabihf ;;
+  esac
+}
+cross_debian_arch() {
+  case "$1" in
+    aarch64) echo arm64 ;;
+    armhf) echo armhf ;;
+  esac
+}

@@ -1,12 +1,16 @@
 // A program outside the repository, built against an installed copy of the
 // library: it opens a store, writes one object offline and reads it back,
 // removes the store, then builds a wire payload and reads it back through the
-// installed generated tables, as a transport would.
+// installed generated tables, as a transport would, and finally syncs a store
+// through the installed reference server and loopback transport.
+#include <chrono>
 #include <cstdio>
 #include <string>
 #include <thread>
 
 #include "platform/Log.h"
+#include "server/LoopbackTransport.h"
+#include "server/SyncServer.h"
 #include "tessarine/Collection.h"
 #include "tessarine/Cursor.h"
 #include "tessarine/Protocol.h"
@@ -27,6 +31,27 @@ class PlainThreadCreator : public ThreadCreator {
 public:
     std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
 };
+
+// True once the store's object has come back from the server PERSISTED.
+bool syncsThroughTheServer(const std::string& path) {
+    using namespace lumivale::tessarine;
+    auto server = std::make_shared<server::SyncServer>();
+    auto store = Tessarine::open(path, std::make_shared<server::LoopbackTransport>(server),
+                                 std::make_shared<PlainThreadCreator>());
+    if (!store) return false;
+    store->start();
+    auto items = store->subscribeCollection("app:items");
+    if (!items || !items->saveObject("pk", "sort", std::vector<unsigned char>{3})) return false;
+    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+    bool persisted = false;
+    while (!persisted && std::chrono::steady_clock::now() < deadline) {
+        auto cursor = items->getObject("pk");
+        persisted = cursor && cursor->step() && cursor->getStatus() == 3 && server->objects("app:items").size() == 1;
+        if (!persisted) std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    items.reset();
+    return store->remove() && persisted;
+}
 
 }  // namespace
 
@@ -52,6 +77,7 @@ int main(int argc, char** argv) {
     auto* table = flatbuffers::GetRoot<tessarine::wire::ServerDelta>(payload.data());
     if (table->primaryKey()->str() != "pk") return 7;
     if (lumivale::tessarine::protocol::makeTessarineDelta(payload, 0).versionId != 3) return 8;
+    if (!syncsThroughTheServer(path + ".synced")) return 9;
     lv_printLog(4, "consumer", "installed package works");
     return 0;
 }
