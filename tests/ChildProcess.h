@@ -11,6 +11,7 @@
 #include <sys/wait.h>
 
 #include <cerrno>
+#include <sstream>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -21,15 +22,21 @@ namespace testsupport {
 
 class ChildProcess {
 public:
-    // Starts program with the given arguments (argv[0] is the program).
-    ChildProcess(const std::string& program, const std::vector<std::string>& arguments) {
-        std::vector<std::string> all{program};
+    // Starts program with the given arguments. A non-empty emulator (words
+    // separated by blanks, the first one looked up in PATH) runs the
+    // program, as a cross build's test programs are run.
+    ChildProcess(const std::string& program, const std::vector<std::string>& arguments,
+                 const std::string& emulator = "") {
+        std::vector<std::string> all;
+        std::istringstream words(emulator);
+        for (std::string word; words >> word;) all.push_back(word);
+        all.push_back(program);
         all.insert(all.end(), arguments.begin(), arguments.end());
         std::vector<char*> argv;
         for (std::string& argument : all) argv.push_back(argument.data());
         argv.push_back(nullptr);
-        int rc = posix_spawn(&pid, program.c_str(), nullptr, nullptr, argv.data(), environ);
-        if (rc != 0) throw std::runtime_error("cannot start " + program + ": error " + std::to_string(rc));
+        int rc = posix_spawnp(&pid, argv[0], nullptr, nullptr, argv.data(), environ);
+        if (rc != 0) throw std::runtime_error("cannot start " + all[0] + ": error " + std::to_string(rc));
     }
 
     // A child still running when the object goes is killed and reaped.

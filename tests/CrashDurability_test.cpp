@@ -31,7 +31,7 @@ using Direction = ts::CollectionStorage::SortDirection;
 using testsupport::Journal;
 using testsupport::JournalWrite;
 
-#ifdef TESSARINE_TEST_SANITIZED
+#if defined(TESSARINE_TEST_SANITIZED) || defined(TESSARINE_TEST_EMULATED)
 constexpr int kCycles = 30;  // every process runs several times slower
 #else
 constexpr int kCycles = 60;
@@ -283,9 +283,10 @@ TEST_F(CrashDurabilityTest, AcknowledgedWritesSurviveSigkillAndQueueIsResentOnce
         SCOPED_TRACE("cycle " + std::to_string(cycle));
         const std::string journalPath = dir.file("journal-" + std::to_string(cycle));
         {
-            testsupport::ChildProcess writer(TESSARINE_CRASH_WRITER,
-                                             {path, journalPath, std::to_string(random()),
-                                              std::to_string((cycle + 1) * 1000000ULL)});
+            testsupport::ChildProcess writer(
+                TESSARINE_CRASH_WRITER,
+                {path, journalPath, std::to_string(random()), std::to_string((cycle + 1) * 1000000ULL)},
+                TESSARINE_TEST_EMULATOR);
             // Most kills come while the writer runs its loops; some while it
             // is still opening the store.
             if (random() % 8 != 0) {

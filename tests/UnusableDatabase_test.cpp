@@ -88,7 +88,7 @@ std::vector<std::string> probeReadOnly(const std::string& folder, fs::perms fold
     std::ofstream(report).close();
     fs::permissions(report, fs::perms::owner_read | fs::perms::owner_write | fs::perms::group_read |
                                 fs::perms::group_write | fs::perms::others_read | fs::perms::others_write);
-    testsupport::ChildProcess probe(TESSARINE_READONLY_PROBE, {path, report});
+    testsupport::ChildProcess probe(TESSARINE_READONLY_PROBE, {path, report}, TESSARINE_TEST_EMULATOR);
     int status = probe.wait();
     fs::permissions(folder, fs::perms::owner_all, fs::perm_options::add);
     fs::permissions(path, fs::perms::owner_read | fs::perms::owner_write, fs::perm_options::add);
