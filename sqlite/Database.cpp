@@ -35,6 +35,21 @@ void rollbackLevel(Connection& connection, int depth) {
     }
 }
 
+// True when text, what follows the first statement of a prepared string,
+// holds more than blanks, comments and semicolons.
+bool holdsAnotherStatement(sqlite3* handle, const char* text, const char* end) {
+    while (text != nullptr && text < end) {
+        sqlite3_stmt* extra = nullptr;
+        const char* next = nullptr;
+        int rc = sqlite3_prepare_v2(handle, text, static_cast<int>(end - text), &extra, &next);
+        sqlite3_finalize(extra);
+        if (rc != SQLITE_OK || extra != nullptr) return true;
+        if (next == nullptr || next <= text) return false;
+        text = next;
+    }
+    return false;
+}
+
 }  // namespace
 
 Database::Database(const std::string& path, int flags)
@@ -53,13 +68,26 @@ void Database::exec(const std::string& sql) {
     connection->exec(sql);
 }
 
+bool Database::isReadOnly() const {
+    std::lock_guard<std::recursive_mutex> lock(connection->mutex());
+    return sqlite3_db_readonly(connection->handle(), "main") == 1;
+}
+
 Statement Database::prepare(const std::string& sql) {
     std::lock_guard<std::recursive_mutex> lock(connection->mutex());
     sqlite3_stmt* statement = nullptr;
-    int rc = sqlite3_prepare_v2(connection->handle(), sql.c_str(), static_cast<int>(sql.size()), &statement,
-                                nullptr);
+    const char* tail = nullptr;
+    int rc = sqlite3_prepare_v2(connection->handle(), sql.c_str(), static_cast<int>(sql.size()), &statement, &tail);
     if (rc != SQLITE_OK) connection->fail(rc, "preparing: " + sql);
-    return Statement(connection, statement);
+    Statement prepared(connection, statement);
+    // SQLite compiles the first statement and silently ignores the rest of
+    // the text. Text meant as one statement (an application's index
+    // subquery is spliced into one) must not lose a part unnoticed.
+    if (statement == nullptr) throw SQLiteException(SQLITE_ERROR, "no statement in the text", "preparing: " + sql);
+    if (holdsAnotherStatement(connection->handle(), tail, sql.c_str() + sql.size())) {
+        throw SQLiteException(SQLITE_ERROR, "more than one statement in the text", "preparing: " + sql);
+    }
+    return prepared;
 }
 
 void Database::runInTransaction(const std::function<void()>& fn, TransactionType type) {

@@ -65,7 +65,14 @@ public:
     // Runs one SQL statement to completion; rows it returns are discarded.
     void exec(const std::string& sql);
 
-    // Compiles one statement with ? placeholders.
+    // True when SQLite opened the main database for reading only, which it
+    // does without an error when a read-write open meets a file that cannot
+    // be written.
+    bool isReadOnly() const;
+
+    // Compiles one statement with ? placeholders. Text without a statement,
+    // or with anything but blanks, comments and semicolons after the first
+    // one, throws instead of being cut silently.
     Statement prepare(const std::string& sql);
 
     // Begins a transaction of the given type, runs fn and commits. If fn

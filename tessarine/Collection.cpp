@@ -100,19 +100,18 @@ bool Collection::deleteObject(const std::string& primaryKey) noexcept {
                  "Error while deleting object: %s");
 }
 
-// Numbers the change with the collection's next version id (committed on its
-// own first) and hands it to the delta handler.
+// Hands the change to the delta handler, which numbers it with the
+// collection's next version id (committed on its own first) and queues it.
 bool Collection::write(SyncProtocol::DeltaType type, const std::string& primaryKey, const std::string& sortKey,
                        const unsigned char* blob, unsigned int blobSize, const char* errorFormat) noexcept {
     try {
         SyncProtocol::Delta delta;
         delta.collectionName = collectionName;
-        delta.versionId = collectionStorage->incrementAndGetVersionId(collectionName);
         delta.type = type;
         delta.primaryKey = primaryKey;
         delta.sortKey = sortKey;
         if (blobSize != 0) delta.blob.assign(blob, blob + blobSize);
-        deltaHandler->addLocalDelta(delta);
+        deltaHandler->addLocalDeltaWithNextVersionId(std::move(delta));
         return true;
     } catch (const std::exception& e) {
         lv_printLog(6, "tessarine", errorFormat, e.what());

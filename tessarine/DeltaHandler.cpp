@@ -58,12 +58,28 @@ DeltaHandler::~DeltaHandler() {
 }
 
 void DeltaHandler::addLocalDelta(const SyncProtocol::Delta& delta) {
+    {
+        std::lock_guard<std::mutex> lock(localWriteMutex);
+        queueAndApplyLocalDelta(delta);
+    }
+    callDeltaCallbacks({delta}, SyncProtocol::DeltaStatus::PENDING);
+}
+
+void DeltaHandler::addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta) {
+    {
+        std::lock_guard<std::mutex> lock(localWriteMutex);
+        delta.versionId = collectionStorage->incrementAndGetVersionId(delta.collectionName);
+        queueAndApplyLocalDelta(delta);
+    }
+    callDeltaCallbacks({delta}, SyncProtocol::DeltaStatus::PENDING);
+}
+
+void DeltaHandler::queueAndApplyLocalDelta(const SyncProtocol::Delta& delta) {
     if (stopped) throw std::runtime_error("DeltaHandler already stopped");
     database->runInTransaction([&] {
         deltaQueue->addDelta(delta, SyncProtocol::DeltaStatus::PENDING);
         applyDelta(delta, CollectionStorage::ObjectStatus::PENDING);
     }, kImmediate);
-    callDeltaCallbacks({delta}, SyncProtocol::DeltaStatus::PENDING);
 }
 
 void DeltaHandler::postJob(std::function<void()> work) {

@@ -2,7 +2,10 @@
 //
 // Local path (application thread): addLocalDelta queues and sends the delta
 // and writes the object with status PENDING in one transaction, then tells
-// the application's callbacks. Incoming path (transport thread, then the
+// the application's callbacks. Local writes are serialised by a lock of
+// their own, which addLocalDeltaWithNextVersionId also holds while it takes
+// the version id, so each collection's changes reach the queue and the
+// transport in version-id order whatever threads write. Incoming path (transport thread, then the
 // worker): a delivery becomes one job and one transaction; own deltas retire
 // their queue row and have their object's status recomputed, other clients'
 // deltas are applied as PERSISTED unless a local change of the object is
@@ -20,6 +23,7 @@
 
 #include <atomic>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -57,6 +61,12 @@ public:
     // The caller has filled collectionName, versionId, type, primaryKey and,
     // for a save, sortKey and blob. Throws; nothing is kept on failure.
     virtual void addLocalDelta(const SyncProtocol::Delta& delta);
+    // The local write path of a Collection: takes the collection's next
+    // version id (committed on its own, so that a failed write uses it up),
+    // then adds the delta as addLocalDelta does. Both steps happen under one
+    // lock, so that concurrent writers hand each collection's changes to the
+    // queue and the transport in version-id order. Throws as addLocalDelta.
+    virtual void addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta);
 
     void onDeltaReceived(const std::vector<SyncProtocol::Delta>& deltas);
     void onDeltaStatusUpdated(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
@@ -75,6 +85,9 @@ public:
     Delta convertMQTTDeltaToApiDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
 
 private:
+    // Queues, sends and applies the delta in one transaction; localWriteMutex
+    // is held.
+    void queueAndApplyLocalDelta(const SyncProtocol::Delta& delta);
     void processDelivery(const std::vector<SyncProtocol::Delta>& deltas);
     void processStatusUpdate(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     void postJob(std::function<void()> work);
@@ -92,6 +105,10 @@ private:
     int deltaReceivedCallbackId = 0;
     int lifecycleStopCallbackId = 0;
     std::atomic<bool> stopped{false};
+    // Held from taking a local change's version id until it is queued and
+    // sent, never while application callbacks run; taken before the
+    // database's lock.
+    std::mutex localWriteMutex;
 };
 
 }  // namespace tessarine

@@ -7,6 +7,7 @@
 
 #include "platform/Log.h"
 #include "sqlite/Database.h"
+#include "sqlite/SQLiteException.h"
 #include "tessarine/CollectionIndexStorage.h"
 #include "tessarine/CollectionObjectStorage.h"
 #include "tessarine/DeltaHandler.h"
@@ -29,6 +30,7 @@ namespace tessarine {
 namespace {
 
 constexpr int kOpenReadWriteCreate = 6;  // SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE
+constexpr int kSqliteReadOnly = 8;       // SQLITE_READONLY
 
 // The worker's pauses between attempts of a failing job: 5 ms, doubling,
 // at most 30 s.
@@ -131,6 +133,12 @@ void Tessarine::setCollectionIndexerFunction(const CallbackManager::CollectionIn
 std::shared_ptr<lumivale::sqlite::Database> Tessarine::createSqliteDatabase(const std::string& path,
                                                                             const TessarineOptions& options) {
     auto database = std::make_shared<lumivale::sqlite::Database>(path, kOpenReadWriteCreate);
+    // SQLite falls back to reading only when the file cannot be written; a
+    // store that opened so could not even subscribe to its collections.
+    if (database->isReadOnly()) {
+        throw lumivale::sqlite::SQLiteException(kSqliteReadOnly, "the database file cannot be written",
+                                                "opening database \"" + path + "\"");
+    }
     database->exec("PRAGMA temp_store=" + options.tempStore);
     database->exec("PRAGMA journal_mode=" + options.journalMode);
     database->exec("PRAGMA synchronous=" + options.synchronous);

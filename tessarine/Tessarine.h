@@ -92,7 +92,8 @@ public:
     // Opens (creating if needed) the database at path with flags read-write |
     // create and issues the four pragmas of options, in the order temp_store,
     // journal_mode, synchronous, busy_timeout. "" and ":memory:" keep SQLite's
-    // meaning. Throws lumivale::sqlite::SQLiteException.
+    // meaning. Throws lumivale::sqlite::SQLiteException, also when the file
+    // could only be opened for reading.
     static std::shared_ptr<lumivale::sqlite::Database> createSqliteDatabase(const std::string& path,
                                                                             const TessarineOptions& options);
 

@@ -1,0 +1,77 @@
+// Runs a helper program of the test suite as a separate process, for tests
+// that must kill a store abruptly or run it with other rights. Uses
+// posix_spawn, which is safe in a test process that runs threads (a bare fork
+// is not, under ThreadSanitizer). The child shares the test's standard output
+// and error, so whatever a sanitizer reports in it shows in the test's log.
+#pragma once
+
+#include <signal.h>
+#include <spawn.h>
+#include <sys/types.h>
+#include <sys/wait.h>
+
+#include <cerrno>
+#include <sstream>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+extern char** environ;
+
+namespace testsupport {
+
+class ChildProcess {
+public:
+    // Starts program with the given arguments. A non-empty emulator (words
+    // separated by blanks, the first one looked up in PATH) runs the
+    // program, as a cross build's test programs are run.
+    ChildProcess(const std::string& program, const std::vector<std::string>& arguments,
+                 const std::string& emulator = "") {
+        std::vector<std::string> all;
+        std::istringstream words(emulator);
+        for (std::string word; words >> word;) all.push_back(word);
+        all.push_back(program);
+        all.insert(all.end(), arguments.begin(), arguments.end());
+        std::vector<char*> argv;
+        for (std::string& argument : all) argv.push_back(argument.data());
+        argv.push_back(nullptr);
+        int rc = posix_spawnp(&pid, argv[0], nullptr, nullptr, argv.data(), environ);
+        if (rc != 0) throw std::runtime_error("cannot start " + all[0] + ": error " + std::to_string(rc));
+    }
+
+    // A child still running when the object goes is killed and reaped.
+    ~ChildProcess() {
+        if (!reaped) {
+            ::kill(pid, SIGKILL);
+            wait();
+        }
+    }
+    ChildProcess(const ChildProcess&) = delete;
+    ChildProcess& operator=(const ChildProcess&) = delete;
+
+    void kill(int signal) { ::kill(pid, signal); }
+
+    // Waits for the child to end and returns its wait status (see waitpid).
+    int wait() {
+        if (!reaped) {
+            while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+            }
+            reaped = true;
+        }
+        return status;
+    }
+
+private:
+    pid_t pid = -1;
+    int status = 0;
+    bool reaped = false;
+};
+
+// "exit 3", "signal 9": how a child ended, for failure messages.
+inline std::string describeWaitStatus(int status) {
+    if (WIFEXITED(status)) return "exit " + std::to_string(WEXITSTATUS(status));
+    if (WIFSIGNALED(status)) return "signal " + std::to_string(WTERMSIG(status));
+    return "status " + std::to_string(status);
+}
+
+}  // namespace testsupport

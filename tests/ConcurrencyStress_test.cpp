@@ -1,0 +1,264 @@
+// Several application threads write into shared and separate collections of
+// one store while the reference server, over a faulty loopback link,
+// delivers echoes, status notices, another client's changes, reconnections
+// and snapshots. Built to run under ThreadSanitizer: a data race fails the
+// run, a deadlock trips the watchdog, and at the end everything must have
+// converged on the server's state.
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cstdio>
+#include <map>
+#include <random>
+#include <thread>
+
+#include "StoreTestSupport.h"
+#include "SyncDevice.h"
+#include "Watchdog.h"
+#include "server/LoopbackTransport.h"
+#include "server/SyncServer.h"
+
+#if defined(__SANITIZE_THREAD__)
+#define TESSARINE_TEST_THREAD_SANITIZER 1
+#elif defined(__has_feature)
+#if __has_feature(thread_sanitizer)
+#define TESSARINE_TEST_THREAD_SANITIZER 1
+#endif
+#endif
+
+namespace {
+
+namespace ts = lumivale::tessarine;
+using ts::server::FaultRates;
+using ts::server::LoopbackTransport;
+using ts::server::SyncServer;
+using Bytes = std::vector<unsigned char>;
+
+// Sized for about a minute under ThreadSanitizer, the build this test is
+// for; the other builds run it in seconds.
+#if defined(TESSARINE_TEST_THREAD_SANITIZER)
+constexpr int kWritesPerThread = 4000;
+#elif defined(TESSARINE_TEST_EMULATED)
+constexpr int kWritesPerThread = 500;
+#else
+constexpr int kWritesPerThread = 2000;
+#endif
+constexpr int kWriterThreads = 3;
+constexpr int kKeys = 8;
+const char* const kShared = "app:shared";
+
+std::string ownCollection(int thread) { return "app:own" + std::to_string(thread); }
+
+// The client id of the store at path, which an application asking the
+// server for a snapshot has to name: the store sends it with every
+// subscription.
+std::string clientIdOf(const std::string& path) {
+    testsupport::StoreUnderTest probe(path);
+    if (!probe.store || !probe.store->subscribeCollection(kShared)) return "";
+    return probe.transport->sentSubscriptions().at(0).clientId;
+}
+
+// What the application's callback heard: each writing thread's local
+// changes (status PENDING, heard on that thread before the write returns).
+class CallbackLog {
+public:
+    void heard(const std::vector<ts::Delta>& deltas) {
+        std::lock_guard<std::mutex> lock(mutex);
+        for (const ts::Delta& delta : deltas) {
+            if (delta.status == ts::SyncProtocol::DeltaStatus::PENDING) {
+                lastPending[std::this_thread::get_id()] = delta;
+                ++pendingCount[std::this_thread::get_id()];
+            }
+            ++byStatus[static_cast<int>(delta.status)];
+        }
+    }
+    // The last PENDING change heard on the calling thread.
+    ts::Delta lastPendingOnThisThread() {
+        std::lock_guard<std::mutex> lock(mutex);
+        return lastPending[std::this_thread::get_id()];
+    }
+    // How many PENDING changes were heard on the calling thread.
+    int pendingOnThisThread() {
+        std::lock_guard<std::mutex> lock(mutex);
+        return pendingCount[std::this_thread::get_id()];
+    }
+    int count(ts::SyncProtocol::DeltaStatus status) {
+        std::lock_guard<std::mutex> lock(mutex);
+        return byStatus[static_cast<int>(status)];
+    }
+
+private:
+    std::mutex mutex;
+    std::map<std::thread::id, ts::Delta> lastPending;
+    std::map<std::thread::id, int> pendingCount;
+    std::map<int, int> byStatus;
+};
+
+bool converged(ts::Collection& collection, const SyncServer& server, const std::string& name) {
+    return testsupport::objectRows(collection) == testsupport::serverRows(server, name);
+}
+
+TEST(ConcurrencyStressTest, WritersAndServerTrafficWithFaultsConvergeWithoutRaceOrDeadlock) {
+    testsupport::LogCapture log;
+    testsupport::runWithWatchdog("the concurrency stress test", std::chrono::seconds(240), [&] {
+        testsupport::TempDir dir;
+        auto server = std::make_shared<SyncServer>();
+        CallbackLog callbacks;  // outlives the store that calls it
+        const std::string clientId = clientIdOf(dir.file("store.db"));
+        ASSERT_FALSE(clientId.empty());
+        auto transport = std::make_shared<LoopbackTransport>(server, 7);
+        std::atomic<int> snapshots{0};
+        transport->addSnapshotReceivedCallback([&](const ts::SyncProtocol::Snapshot&) { ++snapshots; });
+        auto store = ts::Tessarine::open(dir.file("store.db"), transport,
+                                         std::make_shared<testsupport::CountingThreadCreator>());
+        ASSERT_TRUE(store);
+        store->addDeltaReceivedCallback([&](const std::vector<ts::Delta>& deltas) { callbacks.heard(deltas); });
+        std::map<std::string, std::unique_ptr<ts::Collection>> handles;
+        handles[kShared] = store->subscribeCollection(kShared);
+        for (int t = 0; t < kWriterThreads; ++t) handles[ownCollection(t)] = store->subscribeCollection(ownCollection(t));
+        for (auto& handle : handles) ASSERT_TRUE(handle.second);
+        // Another client, writing into the shared collection too.
+        testsupport::SyncDevice other(server, dir.file("other.db"), 8);
+        other.collection(kShared);
+
+        const FaultRates faults{0.002, 0.03, 0.02, std::chrono::milliseconds(2)};
+        for (auto direction : {LoopbackTransport::Direction::TO_SERVER, LoopbackTransport::Direction::TO_CLIENT}) {
+            transport->setFaults(direction, faults);
+            other.transport->setFaults(direction, faults);
+        }
+        store->start();
+
+        std::atomic<int> writesDone{0};
+        std::atomic<bool> writing{true};
+        std::vector<std::thread> threads;
+        for (int t = 0; t < kWriterThreads; ++t) {
+            threads.emplace_back([&, t] {
+                // Each thread its own handles, as application threads would.
+                auto shared = store->subscribeCollection(kShared);
+                auto own = store->subscribeCollection(ownCollection(t));
+                std::mt19937 random(static_cast<unsigned>(t));
+                for (int i = 0; i < kWritesPerThread; ++i) {
+                    bool toShared = random() % 2 != 0;
+                    ts::Collection& collection = toShared ? *shared : *own;
+                    std::string key = "k" + std::to_string(random() % kKeys);
+                    bool save = random() % 5 != 0;
+                    Bytes blob{static_cast<unsigned char>(t), static_cast<unsigned char>(i),
+                               static_cast<unsigned char>(i >> 8)};
+                    ASSERT_TRUE(save ? collection.saveObject(key, "s" + std::to_string(random() % 4), blob)
+                                     : collection.deleteObject(key));
+                    // Reported to the application on this thread, PENDING,
+                    // before the write returned.
+                    ts::Delta heard = callbacks.lastPendingOnThisThread();
+                    EXPECT_EQ(i + 1, callbacks.pendingOnThisThread()) << "write " << i << " of thread " << t;
+                    EXPECT_EQ(toShared ? kShared : ownCollection(t), heard.collectionName);
+                    EXPECT_EQ(key, heard.primaryKey);
+                    EXPECT_EQ(save ? blob : Bytes(), heard.blob);
+                    ++writesDone;
+                }
+            });
+        }
+        threads.emplace_back([&] {
+            std::mt19937 random(99);
+            for (int i = 0; i < kWritesPerThread; ++i) {
+                EXPECT_TRUE(other.collection(kShared).saveObject("k" + std::to_string(random() % kKeys), "o",
+                                                                  Bytes{0xEE, static_cast<unsigned char>(i)}));
+            }
+        });
+        // The server side of the traffic that the faults do not make by
+        // themselves: reconnections and snapshots, paced by the writers.
+        int reconnections = 0;
+        int snapshotRequests = 0;
+        std::thread chaos([&] {
+            std::mt19937 random(5);
+            for (int step = 1; writing; ++step) {
+                testsupport::waitUntil([&] { return writesDone >= step * 5 || !writing; });
+                // A dropped message takes the link down; the application
+                // reconnects.
+                if (!transport->isConnected()) transport->connect();
+                if (!other.transport->isConnected()) other.transport->connect();
+                switch (random() % 16) {
+                    case 0:
+                        transport->disconnect();
+                        transport->connect();
+                        ++reconnections;
+                        break;
+                    case 1:
+                    case 2: {
+                        std::string collection = random() % 2 ? kShared : ownCollection(random() % kWriterThreads);
+                        transport->sendSnapshotRequest(collection, clientId);
+                        ++snapshotRequests;
+                        break;
+                    }
+                    default:
+                        break;
+                }
+            }
+        });
+        for (std::thread& thread : threads) thread.join();
+        writing = false;
+        chaos.join();
+
+        // Healthy links from now on: everything must settle on the server's
+        // state, every object PERSISTED, nothing left queued.
+        for (auto direction : {LoopbackTransport::Direction::TO_SERVER, LoopbackTransport::Direction::TO_CLIENT}) {
+            transport->setFaults(direction, {});
+            other.transport->setFaults(direction, {});
+        }
+        bool settled = testsupport::waitUntil([&] {
+            if (!transport->isConnected()) transport->connect();
+            if (!other.transport->isConnected()) other.transport->connect();
+            for (auto& [name, handle] : handles) {
+                if (!converged(*handle, *server, name)) return false;
+            }
+            return converged(other.collection(kShared), *server, kShared);
+        }, std::chrono::seconds(120));
+        for (auto& [name, handle] : handles) {
+            EXPECT_EQ(testsupport::serverRows(*server, name), testsupport::objectRows(*handle)) << name;
+        }
+        ASSERT_TRUE(settled);
+        // The queue empties: the server's copies of the last changes may
+        // still be on their way, but soon a reconnection resends nothing.
+        auto resends = [&] { return log.linesStartingWith("DeltaQueue::onConnectionEstablished: sending "); };
+        std::string lastResend;
+        bool drained = testsupport::waitUntil([&] {
+            size_t before = resends().size();
+            transport->disconnect();
+            transport->connect();
+            if (!testsupport::waitUntil([&] { return resends().size() > before; })) return false;
+            lastResend = resends().back().message;
+            return lastResend == "DeltaQueue::onConnectionEstablished: sending 0 delta(s)";
+        }, std::chrono::seconds(60));
+        EXPECT_TRUE(drained) << lastResend;
+
+        auto faultsSeen = transport->faultCounts();
+        std::printf("stress: %d writes; %llu messages dropped, %llu duplicated, %llu delayed; %d of %d snapshots "
+                    "arrived; %d reconnections\n",
+                    kWriterThreads * kWritesPerThread, static_cast<unsigned long long>(faultsSeen.dropped),
+                    static_cast<unsigned long long>(faultsSeen.duplicated),
+                    static_cast<unsigned long long>(faultsSeen.delayed), snapshots.load(), snapshotRequests,
+                    reconnections);
+        EXPECT_GT(faultsSeen.duplicated + faultsSeen.delayed + faultsSeen.dropped, 0u);
+        EXPECT_GT(snapshots.load(), 0);
+        EXPECT_GT(reconnections, 0);
+        EXPECT_GT(callbacks.count(ts::SyncProtocol::DeltaStatus::SENT), 0);
+        EXPECT_GT(callbacks.count(ts::SyncProtocol::DeltaStatus::PERSISTED), 0);
+
+        // Destroying the store while the other client's changes still
+        // reach it through the server.
+        std::thread lastWriter([&] {
+            for (int i = 0; i < 50; ++i) other.collection(kShared).saveObject("late", "o", Bytes{static_cast<unsigned char>(i)});
+        });
+        handles.clear();
+        store.reset();
+        lastWriter.join();
+        transport.reset();
+        other.close();
+    });
+    for (const auto& line : log.lines()) {
+        if (line.tag == "tessarine") {
+            EXPECT_LT(line.priority, 6) << line.message;
+        }
+    }
+}
+
+}  // namespace

@@ -1,0 +1,120 @@
+// A delivery that cannot be applied yet holds up the store's worker, which
+// retries it; once the cause goes away the store catches up by itself, and
+// everything delivered after it is applied in the order it arrived.
+#include <gtest/gtest.h>
+
+#include "StoreTestSupport.h"
+
+namespace {
+
+namespace ts = lumivale::tessarine;
+using Direction = ts::CollectionStorage::SortDirection;
+using Status = ts::SyncProtocol::DeltaStatus;
+using testsupport::LogCapture;
+using testsupport::rows;
+using testsupport::waitUntil;
+
+class DeliveryRecoveryTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        s.store->addDeltaReceivedCallback([this](const std::vector<ts::Delta>& deltas) {
+            std::lock_guard<std::mutex> lock(heardMutex);
+            for (const auto& d : deltas) {
+                heard.push_back(d.collectionName + "/" + d.primaryKey + ":" + std::to_string(d.blob.empty() ? 0 : d.blob[0]) +
+                                ":" + std::to_string(static_cast<int>(d.status)));
+            }
+        });
+        known = s.store->subscribeCollection("app:known");
+        ASSERT_TRUE(known);
+    }
+
+    static ts::SyncProtocol::Delta remoteSave(const std::string& collection, const std::string& key, unsigned char value,
+                                              uint64_t sequenceNumber) {
+        ts::SyncProtocol::Delta delta;
+        delta.clientId = "ANOTHERCLIENT";
+        delta.collectionName = collection;
+        delta.versionId = sequenceNumber;
+        delta.primaryKey = key;
+        delta.sortKey = key;
+        delta.blob = {value};
+        delta.sequenceNumber = sequenceNumber;
+        return delta;
+    }
+
+    std::vector<std::string> heardSoFar() {
+        std::lock_guard<std::mutex> lock(heardMutex);
+        return heard;
+    }
+
+    // Waits until the worker has failed the delivery in front at least twice.
+    void waitForRetries(const LogCapture& log, const std::string& reason) {
+        ASSERT_TRUE(waitUntil([&] { return log.linesStartingWith("Failed to process received deltas: " + reason).size() >= 2; }));
+    }
+
+    std::mutex heardMutex;
+    std::vector<std::string> heard;  // "collection/key:first blob byte:status", in order
+    testsupport::TempDir dir;
+    testsupport::StoreUnderTest s{dir.file("store.db")};
+    std::unique_ptr<ts::Collection> known;
+};
+
+TEST_F(DeliveryRecoveryTest, ChangeForUnsubscribedCollectionWaitsForSubscriptionThenEverythingAppliesInOrder) {
+    LogCapture log;
+    s.transport->onDeltaReceived({remoteSave("app:later", "x", 1, 5)});  // no tables for app:later yet
+    s.transport->onDeltaReceived({remoteSave("app:known", "y", 1, 6)});
+    s.transport->onDeltaReceived({remoteSave("app:known", "y", 2, 7)});
+    // Local writes do not wait for the worker; their status notices do.
+    ASSERT_TRUE(known->saveObject("z", "z", std::vector<unsigned char>{9}));
+    ts::SyncProtocol::Delta sentZ = s.transport->sentDeltas().back();
+    s.transport->onDeltaStatusUpdated({sentZ, Status::SENT});
+    waitForRetries(log, "no such table");
+    EXPECT_EQ((std::vector<std::string>{"app:known/z:9:1"}), heardSoFar());
+    EXPECT_EQ((std::vector<std::string>{"z=z:1:1"}), rows(known->query("", -1, Direction::ASCENDING)));
+
+    auto later = s.store->subscribeCollection("app:later");
+    ASSERT_TRUE(later);
+    ASSERT_TRUE(waitUntil([&] { return heardSoFar().size() == 5; }));
+    EXPECT_EQ((std::vector<std::string>{"app:known/z:9:1", "app:later/x:1:3", "app:known/y:1:3", "app:known/y:2:3",
+                                        "app:known/z:9:2"}),
+              heardSoFar());
+    EXPECT_EQ((std::vector<std::string>{"x=x:3:1"}), rows(later->query("", -1, Direction::ASCENDING)));
+    EXPECT_EQ((std::vector<std::string>{"y=y:3:1", "z=z:2:1"}), rows(known->query("", -1, Direction::ASCENDING)));
+
+    // The later changes' sequence number was kept: a reconnection continues
+    // from there.
+    s.transport->clearSent();
+    s.transport->onConnectionEstablished();
+    bool resubscribed = false;
+    for (const auto& request : s.transport->sentSubscriptions()) {
+        if (request.collectionName == "app:known") {
+            EXPECT_EQ(7u, request.sequenceNumber);
+            resubscribed = true;
+        }
+    }
+    EXPECT_TRUE(resubscribed);
+}
+
+TEST_F(DeliveryRecoveryTest, ChangeTheIndexerRejectsIsRetriedUntilTheIndexerIsFixed) {
+    auto indexer = [](bool acceptAll) {
+        return [acceptAll](const std::string&, const std::string&, const std::string&,
+                           const std::vector<unsigned char>& blob) {
+            if (!acceptAll && blob.at(0) == 0xEE) throw std::runtime_error("cannot index");
+            return std::unordered_multimap<std::string, std::string>{{"first", std::to_string(blob.at(0))}};
+        };
+    };
+    s.store->setCollectionIndexerFunction(indexer(false));
+    LogCapture log;
+    s.transport->onDeltaReceived({remoteSave("app:known", "bad", 0xEE, 3)});
+    s.transport->onDeltaReceived({remoteSave("app:known", "good", 1, 4)});
+    waitForRetries(log, "cannot index");
+    EXPECT_TRUE(rows(known->query("", -1, Direction::ASCENDING)).empty());
+
+    s.store->setCollectionIndexerFunction(indexer(true));
+    ASSERT_TRUE(waitUntil([&] { return heardSoFar().size() == 2; }));
+    EXPECT_EQ((std::vector<std::string>{"app:known/bad:238:3", "app:known/good:1:3"}), heardSoFar());
+    EXPECT_EQ((std::vector<std::string>{"bad=bad:3:1"}),
+              rows(known->queryWithIndex("SELECT primary_key FROM {0} WHERE field_name = 'first' AND field_value = '238'",
+                                         {}, -1)));
+}
+
+}  // namespace

@@ -1,0 +1,250 @@
+// Input that an application may hand the store by accident or design, all
+// through the public API: keys and blobs made of any bytes, very large blobs,
+// index subqueries that are not one valid statement, and callbacks, indexers
+// and transports that throw. Each is stored verbatim or refused with a clear
+// error, and nothing stored before is lost.
+#include <gtest/gtest.h>
+
+#include <map>
+
+#include "StoreTestSupport.h"
+
+namespace {
+
+namespace ts = lumivale::tessarine;
+using Direction = ts::CollectionStorage::SortDirection;
+using testsupport::LogCapture;
+using testsupport::rows;
+using testsupport::StoreUnderTest;
+using testsupport::TempDir;
+using Bytes = std::vector<unsigned char>;
+
+struct Object {
+    std::string sortKey;
+    Bytes blob;
+    int status;
+    bool operator==(const Object& o) const { return sortKey == o.sortKey && blob == o.blob && status == o.status; }
+};
+
+std::ostream& operator<<(std::ostream& out, const Object& o) {
+    return out << "{sort " << ::testing::PrintToString(o.sortKey) << ", " << o.blob.size() << " bytes, status "
+               << o.status << "}";
+}
+
+// Every object a cursor yields, by primary key.
+std::map<std::string, Object> objects(std::unique_ptr<ts::Cursor> cursor) {
+    std::map<std::string, Object> result;
+    while (cursor && cursor->step()) {
+        auto blob = cursor->getBlob();
+        result[cursor->getPrimaryKey()] = {cursor->getSortKey(), Bytes(blob.first, blob.first + blob.second),
+                                           cursor->getStatus()};
+    }
+    return result;
+}
+
+Bytes bytesOf(const std::string& text) { return Bytes(text.begin(), text.end()); }
+
+// Keys that break naive quoting, string handling or formatting.
+const std::vector<std::string>& hostileKeys() {
+    static const std::vector<std::string> keys{
+        "it's", "\"quoted\"", "'); DELETE FROM \"collection_app:items\"; --", std::string("a\0b", 3), "a",
+        "\xff\xfe\x80\x01", "Gr\xc3\xbc\xc3\x9f" "e \xe2\x82\xac", "%s%n%d", "{0}", std::string("\0", 1), ""};
+    return keys;
+}
+
+TEST(HostileInputTest, KeysAndBlobsOfAnyBytesRoundTripVerbatimEverywhereAndAcrossReopen) {
+    TempDir dir;
+    const std::string path = dir.file("store.db");
+    const auto& keys = hostileKeys();
+    auto sortKeyOf = [&](size_t i) { return keys[(i + 3) % keys.size()] + std::to_string(i); };
+    auto blobOf = [&](size_t i) {
+        Bytes blob = bytesOf(keys[i]);
+        blob.insert(blob.end(), {0, 0xff, '"', '\'', 0});
+        return blob;
+    };
+    std::map<std::string, Object> expected;
+    for (size_t i = 0; i < keys.size(); ++i) expected[keys[i]] = {sortKeyOf(i), blobOf(i), 1};
+    ts::SyncProtocol::Delta remote;
+    remote.clientId = "ANOTHERCLIENT";
+    remote.collectionName = "app:items";
+    remote.primaryKey = "'; DROP TABLE delta_queue; --\x01\xfe";
+    remote.sortKey = std::string("\0\0", 2);
+    remote.blob = {0, 0, 0};
+    remote.sequenceNumber = 3;
+    {
+        std::vector<ts::Delta> heard;  // before the store, whose worker fills it
+        std::mutex heardMutex;
+        StoreUnderTest s(path);
+        s.store->addDeltaReceivedCallback([&](const std::vector<ts::Delta>& deltas) {
+            std::lock_guard<std::mutex> lock(heardMutex);
+            heard.insert(heard.end(), deltas.begin(), deltas.end());
+        });
+        s.store->setCollectionIndexerFunction(
+            [](const std::string&, const std::string& key, const std::string& sortKey, const Bytes&) {
+                return std::unordered_multimap<std::string, std::string>{{"key", key}, {"sort", sortKey}};
+            });
+        auto items = s.store->subscribeCollection("app:items");
+        ASSERT_TRUE(items);
+        for (size_t i = 0; i < keys.size(); ++i) ASSERT_TRUE(items->saveObject(keys[i], sortKeyOf(i), blobOf(i))) << i;
+
+        auto sent = s.transport->sentDeltas();
+        ASSERT_EQ(keys.size(), sent.size());
+        for (size_t i = 0; i < keys.size(); ++i) {
+            EXPECT_EQ(keys[i], sent[i].primaryKey) << i;
+            EXPECT_EQ(sortKeyOf(i), sent[i].sortKey) << i;
+            EXPECT_EQ(blobOf(i), sent[i].blob) << i;
+            EXPECT_EQ(keys[i], heard[i].primaryKey) << i;
+            EXPECT_EQ(blobOf(i), heard[i].blob) << i;
+        }
+        EXPECT_EQ(expected, objects(items->query("", -1, Direction::ASCENDING)));
+        for (size_t i = 0; i < keys.size(); ++i) {
+            auto one = objects(items->getObject(keys[i]));
+            ASSERT_EQ(1u, one.size()) << i;
+            EXPECT_EQ(keys[i], one.begin()->first);
+            auto byIndex = objects(items->queryWithIndex(
+                "SELECT primary_key FROM {0} WHERE field_name = 'key' AND field_value = ?", {keys[i]}, -1));
+            ASSERT_EQ(1u, byIndex.size()) << i;
+            EXPECT_EQ(keys[i], byIndex.begin()->first);
+        }
+
+        s.transport->onDeltaReceived({remote});
+        ASSERT_TRUE(testsupport::waitUntil([&] {
+            std::lock_guard<std::mutex> lock(heardMutex);
+            return heard.size() == keys.size() + 1;
+        }));
+        expected[remote.primaryKey] = {remote.sortKey, remote.blob, 3};
+        EXPECT_EQ(expected, objects(items->query("", -1, Direction::ASCENDING)));
+
+        ASSERT_TRUE(items->deleteObject(std::string("a\0b", 3)));
+        expected.erase(std::string("a\0b", 3));
+        EXPECT_EQ(expected, objects(items->query("", -1, Direction::ASCENDING)));
+    }
+    StoreUnderTest s(path);
+    auto items = s.store->subscribeCollection("app:items");
+    EXPECT_EQ(expected, objects(items->query("", -1, Direction::ASCENDING)));
+    s.transport->onConnectionEstablished();
+    auto resent = s.transport->sentDeltas();
+    ASSERT_EQ(keys.size() + 1, resent.size());
+    for (size_t i = 0; i < keys.size(); ++i) {
+        EXPECT_EQ(keys[i], resent[i].primaryKey) << i;
+        EXPECT_EQ(blobOf(i), resent[i].blob) << i;
+    }
+    EXPECT_EQ(std::string("a\0b", 3), resent.back().primaryKey);
+}
+
+TEST(HostileInputTest, BlobOfTensOfMegabytesIsStoredSentAndResentWhole) {
+    TempDir dir;
+    const std::string path = dir.file("store.db");
+    Bytes big(40u << 20);
+    for (size_t i = 0; i < big.size(); ++i) big[i] = static_cast<unsigned char>(i * 2654435761u >> 13);
+    {
+        size_t heardSize = 0;
+        StoreUnderTest s(path);
+        s.store->addDeltaReceivedCallback([&](const std::vector<ts::Delta>& deltas) { heardSize = deltas[0].blob.size(); });
+        auto items = s.store->subscribeCollection("app:items");
+        ASSERT_TRUE(items->saveObject("big", "s", big));
+        EXPECT_EQ(big.size(), heardSize);
+        EXPECT_TRUE(big == s.transport->sentDeltas().at(0).blob);
+        EXPECT_TRUE(big == objects(items->getObject("big"))["big"].blob);
+    }
+    StoreUnderTest s(path);
+    auto items = s.store->subscribeCollection("app:items");
+    EXPECT_TRUE(big == objects(items->getObject("big"))["big"].blob);
+    s.transport->onConnectionEstablished();
+    ASSERT_EQ(1u, s.transport->sentDeltas().size());
+    EXPECT_TRUE(big == s.transport->sentDeltas()[0].blob);
+    ASSERT_TRUE(items->saveObject("big", "s", Bytes{1}));
+    EXPECT_EQ(Bytes{1}, objects(items->getObject("big"))["big"].blob);
+}
+
+TEST(HostileInputTest, IndexSubqueriesThatAreNotOneValidStatementFailAndChangeNothing) {
+    TempDir dir;
+    StoreUnderTest s(dir.file("store.db"));
+    s.store->setCollectionIndexerFunction([](const std::string&, const std::string& key, const std::string&, const Bytes&) {
+        return std::unordered_multimap<std::string, std::string>{{"tag", key}};
+    });
+    auto items = s.store->subscribeCollection("app:items");
+    ASSERT_TRUE(items->saveObject("x", "1", Bytes{1}));
+    ASSERT_TRUE(items->saveObject("y", "2", Bytes{2}));
+    const auto before = objects(items->query("", -1, Direction::ASCENDING));
+
+    LogCapture log;
+    // A second statement after the subquery: SQLite would compile the first
+    // one and drop the rest without a word.
+    EXPECT_FALSE(items->queryWithIndex(
+        "SELECT primary_key FROM {0} WHERE field_value = ?) LIMIT ?; DELETE FROM \"collection_app:items\"; --",
+        {"x"}, 5));
+    EXPECT_FALSE(items->queryWithIndex("SELECT primary_key FROM {0}); DROP TABLE delta_queue; --", {}, 5));
+    EXPECT_FALSE(items->queryWithIndex("SELECT primary_key FROM no_such_table", {}, 5));
+    EXPECT_FALSE(items->queryWithIndex("SELECT primary_key FROM {0} WHERE field_value = ?", {"x", "surplus"}, 5));
+    EXPECT_FALSE(items->queryWithIndexSorted("SELECT primary_key FROM {0}) --", {}, "tag", Direction::ASCENDING, 5));
+    auto errors = log.linesStartingWith("Error while querying collection: ");
+    ASSERT_EQ(5u, errors.size());
+    EXPECT_NE(std::string::npos, errors[0].message.find("more than one statement")) << errors[0].message;
+
+    // A hostile sort field name is only ever a bound value.
+    EXPECT_EQ(2u, objects(items->queryWithIndexSorted("SELECT primary_key FROM {0}", {}, "tag' OR 1=1; --",
+                                                      Direction::ASCENDING, -1)).size());
+    EXPECT_EQ(before, objects(items->query("", -1, Direction::ASCENDING)));
+    EXPECT_EQ(1u, objects(items->queryWithIndex("SELECT primary_key FROM {0} WHERE field_value = ?", {"x"}, -1)).size());
+    s.transport->onConnectionEstablished();
+    EXPECT_EQ(4u, s.transport->sentDeltas().size());  // both writes, sent and resent
+}
+
+TEST(HostileInputTest, ThrowingCallbacksIndexersAndTransportLeaveStoredDataAsItWas) {
+    TempDir dir;
+    StoreUnderTest s(dir.file("store.db"));
+    std::atomic<bool> indexerThrows{false};
+    s.store->setCollectionIndexerFunction(
+        [&](const std::string&, const std::string&, const std::string&, const Bytes& blob) {
+            if (indexerThrows) throw std::runtime_error("indexer broke");
+            return std::unordered_multimap<std::string, std::string>{{"first", std::to_string(blob.at(0))}};
+        });
+    std::atomic<int> heardAfterThrowing{0};
+    s.store->addDeltaReceivedCallback([](const std::vector<ts::Delta>&) { throw std::logic_error("callback broke"); });
+    s.store->addDeltaReceivedCallback([&](const std::vector<ts::Delta>&) { ++heardAfterThrowing; });
+    auto items = s.store->subscribeCollection("app:items");
+    LogCapture log;
+
+    // A callback that throws does not undo or fail the write, and the next
+    // callback still hears of it.
+    ASSERT_TRUE(items->saveObject("k", "s", Bytes{1}));
+    EXPECT_EQ(1, heardAfterThrowing.load());
+    EXPECT_EQ(1u, log.linesStartingWith("Exception in delta callback: callback broke").size());
+    const auto stored = objects(items->query("", -1, Direction::ASCENDING));
+    auto indexed = [&] {
+        return objects(items->queryWithIndex("SELECT primary_key FROM {0} WHERE field_name = 'first' AND field_value = '1'",
+                                             {}, -1)).size();
+    };
+    ASSERT_EQ(1u, indexed());
+
+    // Replacing the object fails whole when the indexer or the transport
+    // throws: the old object, its index rows and the queue stay as they were.
+    indexerThrows = true;
+    EXPECT_FALSE(items->saveObject("k", "t", Bytes{2}));
+    indexerThrows = false;
+    s.transport->setFailDeltas(true);
+    EXPECT_FALSE(items->saveObject("k", "t", Bytes{2}));
+    EXPECT_FALSE(items->deleteObject("k"));
+    EXPECT_EQ(1u, log.linesStartingWith("Error while updating object: indexer broke").size());
+    EXPECT_EQ(1u, log.linesStartingWith("Error while updating object: delta send failed").size());
+    EXPECT_EQ(1u, log.linesStartingWith("Error while deleting object: delta send failed").size());
+    EXPECT_EQ(stored, objects(items->query("", -1, Direction::ASCENDING)));
+    EXPECT_EQ(1u, indexed());
+    EXPECT_EQ(1, heardAfterThrowing.load());  // failed writes are not reported
+
+    // A transport that throws while the queue is resent loses nothing: the
+    // next connection sends the whole queue.
+    s.transport->onConnectionEstablished();
+    EXPECT_EQ(1u, log.linesStartingWith("Error in DeltaQueue::onConnectionEstablished: delta send failed").size());
+    s.transport->setFailDeltas(false);
+    s.transport->clearSent();
+    s.transport->onConnectionEstablished();
+    auto resent = s.transport->sentDeltas();
+    ASSERT_EQ(1u, resent.size());
+    EXPECT_EQ(Bytes{1}, resent[0].blob);
+    ASSERT_TRUE(items->saveObject("k", "t", Bytes{2}));
+    EXPECT_EQ(5u, s.transport->sentDeltas().back().versionId);  // three failed writes used up ids 2 to 4
+}
+
+}  // namespace

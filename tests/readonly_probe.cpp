@@ -1,0 +1,80 @@
+// Helper program of the test suite: uses a store whose database file or
+// folder the test has made read-only, with the rights of a user to whom that
+// matters. Run as root it first becomes the unprivileged user 65534, since
+// root writes to read-only files anyway.
+//
+//   readonly_probe <database path> <report file>
+//
+// Writes to the report file (which the test creates writable for everyone),
+// one line each: every log line of the library
+// ("log <priority> <message>"), then "open ok" or "open failed"; after a
+// successful open "subscribe ok" or "subscribe failed"; after a successful
+// subscription one "object <primary key> <blob size> <status>" line per object
+// of the collection "app:items", then "save ok" or "save failed" for a new
+// object. Exit status 0 when the probe ran, 2 when the rights could not be
+// dropped.
+#include <grp.h>
+#include <unistd.h>
+
+#include <cstdio>
+#include <memory>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/Log.h"
+#include "tessarine/Tessarine.h"
+
+namespace {
+
+using namespace lumivale::tessarine;
+
+constexpr uid_t kUnprivilegedId = 65534;
+
+class SilentTransport : public SyncProtocol {
+    void start() override {}
+    void sendSubscriptionRequest(const SubscriptionRequest&) override {}
+    int sendDelta(const Delta&) override { return 0; }
+    void sendSnapshotRequest(const std::string&, const std::string&) override {}
+};
+
+class PlainThreadCreator : public ThreadCreator {
+    std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
+};
+
+bool dropRootRights() {
+    if (geteuid() != 0) return true;
+    return setgroups(0, nullptr) == 0 && setgid(kUnprivilegedId) == 0 && setuid(kUnprivilegedId) == 0;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    if (argc != 3) {
+        std::fprintf(stderr, "usage: readonly_probe <database path> <report file>\n");
+        return 1;
+    }
+    FILE* report = std::fopen(argv[2], "w");
+    if (report == nullptr) return 1;
+    if (!dropRootRights()) {
+        std::fprintf(report, "cannot drop root rights\n");
+        return 2;
+    }
+    lumivale::setLogSink([report](int priority, const std::string&, const std::string& message) {
+        std::fprintf(report, "log %d %s\n", priority, message.c_str());
+    });
+    auto store = Tessarine::open(argv[1], std::make_shared<SilentTransport>(), std::make_shared<PlainThreadCreator>());
+    std::fprintf(report, "open %s\n", store ? "ok" : "failed");
+    if (!store) return 0;
+    auto items = store->subscribeCollection("app:items");
+    std::fprintf(report, "subscribe %s\n", items ? "ok" : "failed");
+    if (!items) return 0;
+    auto cursor = items->query("", -1, CollectionStorage::SortDirection::ASCENDING);
+    while (cursor && cursor->step()) {
+        std::fprintf(report, "object %s %zu %d\n", cursor->getPrimaryKey().c_str(), cursor->getBlob().second,
+                    cursor->getStatus());
+    }
+    cursor.reset();
+    std::fprintf(report, "save %s\n", items->saveObject("new", "s", std::vector<unsigned char>{1}) ? "ok" : "failed");
+    return 0;
+}
