@@ -8,8 +8,10 @@
 // constructor expects the caller to hold mutex().
 #pragma once
 
+#include <atomic>
 #include <mutex>
 #include <string>
+#include <thread>
 
 struct sqlite3;
 
@@ -35,6 +37,10 @@ public:
     // Transactions nest: depth 0 means autocommit. Owned by the thread that
     // holds mutex() for the whole of the outermost transaction.
     int transactionDepth = 0;
+    // The thread that has a transaction open, or no thread. Written under
+    // mutex(), read without it: a thread asking whether it is itself inside
+    // a transaction must not wait for another thread's.
+    std::atomic<std::thread::id> transactionOwner{};
 
 private:
     sqlite3* db = nullptr;

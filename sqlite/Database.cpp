@@ -2,6 +2,8 @@
 
 #include <sqlite3.h>
 
+#include <thread>
+
 #include "sqlite/Connection.h"
 #include "sqlite/SQLiteException.h"
 
@@ -20,6 +22,27 @@ const char* beginSql(Database::TransactionType type) {
 }
 
 std::string savepointName(int depth) { return "tessarine_nested_" + std::to_string(depth); }
+
+// One open level of a transaction, for as long as it lives: counted in the
+// connection's depth and, for the outermost level, the calling thread marked
+// as the owner.
+class OpenLevel {
+public:
+    OpenLevel(Connection& connection, int depth) : connection(connection), depth(depth) {
+        connection.transactionDepth = depth + 1;
+        if (depth == 0) connection.transactionOwner = std::this_thread::get_id();
+    }
+    ~OpenLevel() {
+        connection.transactionDepth = depth;
+        if (depth == 0) connection.transactionOwner = std::thread::id();
+    }
+    OpenLevel(const OpenLevel&) = delete;
+    OpenLevel& operator=(const OpenLevel&) = delete;
+
+private:
+    Connection& connection;
+    int depth;
+};
 
 // Undoes the innermost open level. Errors are swallowed: this runs while an
 // exception is already on its way, and that exception is the one to report.
@@ -73,6 +96,15 @@ bool Database::isReadOnly() const {
     return sqlite3_db_readonly(connection->handle(), "main") == 1;
 }
 
+bool Database::isInTransactionOnThisThread() const {
+    return connection->transactionOwner.load() == std::this_thread::get_id();
+}
+
+long long Database::lastInsertRowId() const {
+    std::lock_guard<std::recursive_mutex> lock(connection->mutex());
+    return sqlite3_last_insert_rowid(connection->handle());
+}
+
 Statement Database::prepare(const std::string& sql) {
     std::lock_guard<std::recursive_mutex> lock(connection->mutex());
     sqlite3_stmt* statement = nullptr;
@@ -95,15 +127,13 @@ void Database::runInTransaction(const std::function<void()>& fn, TransactionType
     Connection& c = *connection;
     const int depth = c.transactionDepth;
     c.exec(depth == 0 ? std::string(beginSql(type)) : "SAVEPOINT " + savepointName(depth));
-    c.transactionDepth = depth + 1;
+    OpenLevel level(c, depth);
     try {
         fn();
     } catch (...) {
-        c.transactionDepth = depth;
         rollbackLevel(c, depth);
         throw;
     }
-    c.transactionDepth = depth;
     try {
         c.exec(depth == 0 ? std::string("COMMIT") : "RELEASE " + savepointName(depth));
     } catch (const SQLiteException&) {

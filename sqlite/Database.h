@@ -70,6 +70,15 @@ public:
     // be written.
     bool isReadOnly() const;
 
+    // True when the calling thread is inside runInTransaction on this
+    // database. Never waits for the connection's lock.
+    bool isInTransactionOnThisThread() const;
+
+    // The rowid of the last row this connection inserted. Meaningful only
+    // inside the transaction that did the insert, which keeps other threads
+    // from inserting in between.
+    long long lastInsertRowId() const;
+
     // Compiles one statement with ? placeholders. Text without a statement,
     // or with anything but blanks, comments and semicolons after the first
     // one, throws instead of being cut silently.

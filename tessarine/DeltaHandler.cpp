@@ -18,6 +18,8 @@ namespace tessarine {
 
 namespace {
 constexpr auto kImmediate = lumivale::sqlite::Database::TransactionType::Immediate;
+const char* const kWriteInsideTransaction =
+    "a change cannot be written from code that the store runs inside its own transaction (an indexer)";
 
 bool isKnownDeltaType(SyncProtocol::DeltaType type) {
     return type == SyncProtocol::DeltaType::SAVE || type == SyncProtocol::DeltaType::DELETE;
@@ -57,29 +59,38 @@ DeltaHandler::~DeltaHandler() {
     syncProtocol->removeDeltaReceivedCallback(deltaReceivedCallbackId);
 }
 
-void DeltaHandler::addLocalDelta(const SyncProtocol::Delta& delta) {
-    {
-        std::lock_guard<std::mutex> lock(localWriteMutex);
-        queueAndApplyLocalDelta(delta);
-    }
-    callDeltaCallbacks({delta}, SyncProtocol::DeltaStatus::PENDING);
-}
+void DeltaHandler::addLocalDelta(const SyncProtocol::Delta& delta) { writeLocalDelta(delta, false); }
 
 void DeltaHandler::addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta) {
-    {
-        std::lock_guard<std::mutex> lock(localWriteMutex);
-        delta.versionId = collectionStorage->incrementAndGetVersionId(delta.collectionName);
-        queueAndApplyLocalDelta(delta);
-    }
-    callDeltaCallbacks({delta}, SyncProtocol::DeltaStatus::PENDING);
+    writeLocalDelta(std::move(delta), true);
 }
 
-void DeltaHandler::queueAndApplyLocalDelta(const SyncProtocol::Delta& delta) {
+void DeltaHandler::writeLocalDelta(SyncProtocol::Delta delta, bool takeNextVersionId) {
+    // Code that the store calls inside one of its transactions (an indexer)
+    // cannot write: its change would become part of a transaction that can
+    // still be rolled back, and this thread may already hold the local write
+    // lock.
+    if (database->isInTransactionOnThisThread()) throw std::runtime_error(kWriteInsideTransaction);
+    {
+        std::lock_guard<std::mutex> lock(localWriteMutex);
+        if (takeNextVersionId) delta.versionId = collectionStorage->incrementAndGetVersionId(delta.collectionName);
+        const int64_t queueId = queueAndApplyLocalDelta(delta);
+        // Still under the lock, so that changes wait to be sent in the order
+        // of their version ids.
+        deltaQueue->addCommitted(queueId, delta);
+    }
+    callDeltaCallbacks({delta}, SyncProtocol::DeltaStatus::PENDING);
+    deltaQueue->sendCommitted();
+}
+
+int64_t DeltaHandler::queueAndApplyLocalDelta(const SyncProtocol::Delta& delta) {
     if (stopped) throw std::runtime_error("DeltaHandler already stopped");
+    int64_t queueId = 0;
     database->runInTransaction([&] {
-        deltaQueue->addDelta(delta, SyncProtocol::DeltaStatus::PENDING);
+        queueId = deltaQueue->addDelta(delta, SyncProtocol::DeltaStatus::PENDING);
         applyDelta(delta, CollectionStorage::ObjectStatus::PENDING);
     }, kImmediate);
+    return queueId;
 }
 
 void DeltaHandler::postJob(std::function<void()> work) {

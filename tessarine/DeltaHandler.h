@@ -1,11 +1,15 @@
 // Where every change to an object becomes a delta and every delta a change.
 //
-// Local path (application thread): addLocalDelta queues and sends the delta
-// and writes the object with status PENDING in one transaction, then tells
-// the application's callbacks. Local writes are serialised by a lock of
-// their own, which addLocalDeltaWithNextVersionId also holds while it takes
-// the version id, so each collection's changes reach the queue and the
-// transport in version-id order whatever threads write. Incoming path (transport thread, then the
+// Local path (application thread): addLocalDelta queues the delta and writes
+// the object with status PENDING in one transaction; once that has
+// committed it tells the application's callbacks and hands the delta to the
+// transport (through the delta queue's sender), holding no lock, so a write
+// that failed never reaches the transport. Local writes are serialised by a
+// lock of their own, which addLocalDeltaWithNextVersionId also holds while
+// it takes the version id, so each collection's changes reach the queue and
+// the transport in version-id order whatever threads write. A write from
+// code that the store runs inside one of its transactions (the indexer) is
+// refused: it could still be rolled back. Incoming path (transport thread, then the
 // worker): a delivery becomes one job and one transaction; own deltas retire
 // their queue row and have their object's status recomputed, other clients'
 // deltas are applied as PERSISTED unless a local change of the object is
@@ -59,7 +63,9 @@ public:
     DeltaHandler& operator=(const DeltaHandler&) = delete;
 
     // The caller has filled collectionName, versionId, type, primaryKey and,
-    // for a save, sortKey and blob. Throws; nothing is kept on failure.
+    // for a save, sortKey and blob. Throws; nothing is kept on failure, and
+    // nothing reaches the transport. A transport that does not take the
+    // change does not fail the write: it stays queued.
     virtual void addLocalDelta(const SyncProtocol::Delta& delta);
     // The local write path of a Collection: takes the collection's next
     // version id (committed on its own, so that a failed write uses it up),
@@ -85,9 +91,10 @@ public:
     Delta convertMQTTDeltaToApiDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
 
 private:
-    // Queues, sends and applies the delta in one transaction; localWriteMutex
-    // is held.
-    void queueAndApplyLocalDelta(const SyncProtocol::Delta& delta);
+    void writeLocalDelta(SyncProtocol::Delta delta, bool takeNextVersionId);
+    // Queues and applies the delta in one transaction and returns its queue
+    // id; localWriteMutex is held.
+    int64_t queueAndApplyLocalDelta(const SyncProtocol::Delta& delta);
     void processDelivery(const std::vector<SyncProtocol::Delta>& deltas);
     void processStatusUpdate(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     void postJob(std::function<void()> work);
@@ -105,9 +112,11 @@ private:
     int deltaReceivedCallbackId = 0;
     int lifecycleStopCallbackId = 0;
     std::atomic<bool> stopped{false};
-    // Held from taking a local change's version id until it is queued and
-    // sent, never while application callbacks run; taken before the
-    // database's lock.
+    // Held from taking a local change's version id until it has committed
+    // and waits to be sent, never while application callbacks or the
+    // transport run (the indexer runs under it, inside the transaction).
+    // Lock order: localWriteMutex before the database's lock; the delta
+    // sender's lock is taken last, under either or none.
     std::mutex localWriteMutex;
 };
 

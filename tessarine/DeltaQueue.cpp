@@ -35,7 +35,7 @@ DeltaQueue::DeltaQueue(std::shared_ptr<lumivale::sqlite::Database> database, std
       deltaQueueStorage(std::move(deltaQueueStorage)),
       serializedJobQueue(std::move(serializedJobQueue)),
       syncProtocol(std::move(syncProtocol)),
-      clientId(std::move(clientId)) {
+      sender(this->syncProtocol, this->deltaQueueStorage, std::move(clientId)) {
     lifecycleStopCallbackId = this->lifecycle->addStopCallback([this] { onLifecycleStop(); });
     connectionEstablishedCallbackId =
         this->syncProtocol->addConnectionEstablishedCallback([this] { onConnectionEstablished(); });
@@ -50,20 +50,15 @@ DeltaQueue::~DeltaQueue() {
     syncProtocol->removeDeltaStatusUpdatedCallback(deltaStatusUpdatedCallbackId);
 }
 
-int DeltaQueue::addDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
-    deltaQueueStorage->insertDelta(delta, status);
-    return sendDelta(delta);
+int64_t DeltaQueue::addDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+    return deltaQueueStorage->insertDelta(delta, status);
 }
 
-int DeltaQueue::sendDelta(const SyncProtocol::Delta& delta) {
-    SyncProtocol::Delta stamped = delta;
-    return stampAndSend(stamped);
+void DeltaQueue::addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexcept {
+    sender.addCommitted(queueId, std::move(delta));
 }
 
-int DeltaQueue::stampAndSend(SyncProtocol::Delta& delta) {
-    delta.clientId = clientId;
-    return syncProtocol->sendDelta(delta);
-}
+void DeltaQueue::sendCommitted() noexcept { sender.sendWaiting(); }
 
 std::optional<SyncProtocol::DeltaStatus> DeltaQueue::getMinStatus(
     const std::vector<SyncProtocol::DeltaStatus>& statuses) {
@@ -140,14 +135,13 @@ void DeltaQueue::processDeltaStatusUpdate(const SyncProtocol::Delta& delta, Sync
 void DeltaQueue::onConnectionEstablished() {
     if (stopped) return;
     try {
-        auto deltas = deltaQueueStorage->getAllDeltas();
+        const int64_t upToId = sender.requestResend();
         lv_printLog(3, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)",
-                    static_cast<unsigned>(deltas.size()));
-        // The deltas read back are ours to stamp: no copy per delta.
-        for (auto& entry : deltas) stampAndSend(entry.first);
+                    static_cast<unsigned>(deltaQueueStorage->countDeltasUpToId(upToId)));
     } catch (const std::exception& e) {
         lv_printLog(6, "tessarine", "Error in DeltaQueue::onConnectionEstablished: %s", e.what());
     }
+    sender.sendWaiting();
 }
 
 void DeltaQueue::onLifecycleStop() { stopped = true; }

@@ -1,11 +1,13 @@
-// The outgoing half of synchronisation. Queues every local delta durably and
-// hands it to the transport at once, sends the whole queue again on every
-// established connection, applies the delivery statuses the transport
+// The outgoing half of synchronisation. Queues every local delta durably,
+// hands it to the transport once its transaction has committed (through a
+// DeltaSender, which keeps the order and resends the whole queue on every
+// established connection), applies the delivery statuses the transport
 // reports (as jobs on the worker), and answers how far an object's queued
 // changes have got.
 //
 // Threads: addDelta runs on the writing thread inside the caller's
-// transaction; onDeltaStatusUpdated only posts a job; status jobs, and the
+// transaction, addCommitted after its commit, sendCommitted outside every
+// lock; onDeltaStatusUpdated only posts a job; status jobs, and the
 // listeners they call after their commit, run on the worker;
 // onConnectionEstablished runs on the transport's thread. Listeners are
 // added while the store is built, before any event can arrive: the list has
@@ -25,6 +27,7 @@
 #include <string>
 #include <vector>
 
+#include "tessarine/DeltaSender.h"
 #include "tessarine/SyncProtocol.h"
 
 namespace lumivale {
@@ -34,7 +37,6 @@ class Database;
 
 namespace tessarine {
 
-class DeltaQueueStorage;
 class Lifecycle;
 class SerializedJobQueue;
 
@@ -58,9 +60,17 @@ public:
     DeltaQueue(const DeltaQueue&) = delete;
     DeltaQueue& operator=(const DeltaQueue&) = delete;
 
-    // Inserts the delta's row, then hands the delta to the transport; returns
-    // what the transport returns. Opens no transaction.
-    virtual int addDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
+    // Inserts the delta's row and returns its queue id. Opens no transaction
+    // and hands nothing to the transport: the caller passes the delta to
+    // addCommitted once its transaction has committed.
+    virtual int64_t addDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
+    // The delta of queue row queueId has committed; callers add in commit
+    // order. Never throws.
+    void addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexcept;
+    // Hands what has committed to the transport on this thread, unless
+    // another thread is doing so already. Call it holding no lock of the
+    // store: the transport may write through the store. Never throws.
+    void sendCommitted() noexcept;
     virtual PendingStatus getPendingStatus(const std::string& collectionName, const std::string& primaryKey);
     // Applies a status to the delta's row (PERSISTED removes it). Returns
     // QUEUE_CHANGED, or QUEUE_UNCHANGED when there is no row or the status is
@@ -68,8 +78,6 @@ public:
     virtual int updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     virtual void addDeltaStatusUpdatedCallback(const DeltaStatusUpdatedCallback& callback);
 
-    // A copy of the delta stamped with this store's client id, to the transport.
-    int sendDelta(const SyncProtocol::Delta& delta);
     // The least advanced status; empty for no statuses.
     std::optional<SyncProtocol::DeltaStatus> getMinStatus(const std::vector<SyncProtocol::DeltaStatus>& statuses);
 
@@ -78,9 +86,6 @@ public:
     void onLifecycleStop();
 
 private:
-    // Stamps a delta the queue owns and hands it to the transport, sparing
-    // the copy that sendDelta makes to leave its caller's delta alone.
-    int stampAndSend(SyncProtocol::Delta& delta);
     void processDeltaStatusUpdate(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
 
     std::shared_ptr<lumivale::sqlite::Database> database;
@@ -88,7 +93,7 @@ private:
     std::shared_ptr<DeltaQueueStorage> deltaQueueStorage;
     std::shared_ptr<SerializedJobQueue> serializedJobQueue;
     std::shared_ptr<SyncProtocol> syncProtocol;
-    std::string clientId;
+    DeltaSender sender;
     std::vector<DeltaStatusUpdatedCallback> deltaStatusUpdatedCallbacks;
     int connectionEstablishedCallbackId = 0;
     int deltaStatusUpdatedCallbackId = 0;

@@ -105,7 +105,41 @@ std::optional<SyncProtocol::DeltaStatus> DeltaQueueStorage::getDeltaStatus(const
     return static_cast<SyncProtocol::DeltaStatus>(statement(0).getInt());
 }
 
-void DeltaQueueStorage::insertDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
+std::vector<DeltaQueueStorage::QueuedDelta> DeltaQueueStorage::getDeltasInIdRange(int64_t afterId, int64_t upToId,
+                                                                                 int limit) {
+    lumivale::sqlite::Database::ScopedLock lock(*database);
+    auto statement = database->prepare(std::string("SELECT  collection_name,  version_id,  type,  primary_key,  "
+                                                   "sort_key,  blob,  id FROM ") +
+                                       getTableName() + " WHERE id > ? AND id <= ? ORDER BY id ASC LIMIT ?");
+    statement.bind(1, static_cast<long long>(afterId));
+    statement.bind(2, static_cast<long long>(upToId));
+    statement.bind(3, limit);
+    std::vector<QueuedDelta> result;
+    while (statement.step()) {
+        QueuedDelta queued;
+        queued.delta = readDelta(statement);
+        queued.id = statement(6).getInt64();
+        result.push_back(std::move(queued));
+    }
+    return result;
+}
+
+int64_t DeltaQueueStorage::countDeltasUpToId(int64_t upToId) {
+    auto statement = database->prepare("SELECT COUNT(*) FROM " + getTableName() + " WHERE id <= ?");
+    statement.bind(1, static_cast<long long>(upToId));
+    statement.step();
+    return statement(0).getInt64();
+}
+
+int64_t DeltaQueueStorage::getLastId() {
+    // AUTOINCREMENT keeps the highest id ever given in sqlite_sequence, also
+    // after its row has gone; without a row there the queue is new.
+    auto statement = database->prepare("SELECT seq FROM sqlite_sequence WHERE name = ?");
+    statement.bind(1, getTableName());
+    return statement.step() ? statement(0).getInt64() : 0;
+}
+
+int64_t DeltaQueueStorage::insertDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
     auto statement = database->prepare(
         "INSERT INTO " + getTableName() +
         " (collection_name, version_id, type, primary_key, sort_key, blob, status) VALUES (?, ?, ?, ?, ?, ?, ?)");
@@ -116,6 +150,7 @@ void DeltaQueueStorage::insertDelta(const SyncProtocol::Delta& delta, SyncProtoc
     statement.bindBlob(6, delta.blob.data(), static_cast<unsigned int>(delta.blob.size()));
     statement.bind(7, static_cast<int>(status));
     statement.step();
+    return database->lastInsertRowId();
 }
 
 void DeltaQueueStorage::updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {

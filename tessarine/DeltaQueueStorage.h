@@ -11,6 +11,7 @@
 // callers decide what runs together. Errors: SQLiteException passes through.
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
@@ -34,6 +35,13 @@ struct CreateDeltaQueueTable {
 
 class DeltaQueueStorage {
 public:
+    // A queued delta with its row id, which orders the queue: ids only grow
+    // and are never reused, so a later insert always has a greater id.
+    struct QueuedDelta {
+        int64_t id = 0;
+        SyncProtocol::Delta delta;
+    };
+
     // Creates the table and its two indexes if they are missing.
     explicit DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> database);
     virtual ~DeltaQueueStorage();
@@ -49,7 +57,14 @@ public:
     virtual std::vector<SyncProtocol::Delta> getDeltaRangeByVersionId(const std::string& collectionName,
                                                                       uint64_t lowestVersionId,
                                                                       uint64_t highestVersionId);
-    virtual void insertDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
+    // Up to limit queued deltas with afterId < id <= upToId, oldest first.
+    virtual std::vector<QueuedDelta> getDeltasInIdRange(int64_t afterId, int64_t upToId, int limit);
+    // How many deltas are queued with id <= upToId.
+    virtual int64_t countDeltasUpToId(int64_t upToId);
+    // The highest id the queue has ever given a row; 0 for a new queue.
+    virtual int64_t getLastId();
+    // Returns the new row's id.
+    virtual int64_t insertDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     // Asserts on PERSISTED: persisted deltas are removed, never stored.
     virtual void updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     virtual void removeDelta(const SyncProtocol::Delta& delta);

@@ -46,12 +46,28 @@ TEST_F(DeltaHandlerTest, LocalSaveIsQueuedSentStoredPendingAndReportedAtOnce) {
     EXPECT_EQ("s-k", got[0].sortKey);
 }
 
-TEST_F(DeltaHandlerTest, FailedLocalWriteLeavesNoRowAndNoCallback) {
+// A transport that does not take a change (offline, a full buffer) must not
+// fail an offline-first write, and must not let a later change of the same
+// collection reach the server before it.
+TEST_F(DeltaHandlerTest, ThrowingTransportKeepsWritesQueuedUntilTheNextConnectionResendsThemInOrder) {
+    LogCapture log;
     transport->setFailDeltas(true);
-    EXPECT_THROW(localSave("a:b", "k"), std::runtime_error);
-    EXPECT_TRUE(deltaQueueStorage->getAllDeltas().empty());
-    EXPECT_EQ(0, object("a:b", "k").first);
-    EXPECT_TRUE(receivedDeltas().empty());
+    localSave("a:b", "k", {1});
+    transport->setFailDeltas(false);
+    localSave("a:b", "k", {2});
+    EXPECT_EQ(1u, log.linesStartingWith("Transport did not take a change, kept queued for the next connection: "
+                                        "delta send failed").size());
+    EXPECT_EQ(5, log.linesStartingWith("Transport did not take").front().priority);
+    EXPECT_TRUE(transport->sentDeltas().empty());
+    EXPECT_EQ(2u, deltaQueueStorage->getAllDeltas().size());
+    EXPECT_EQ(std::make_pair(1, std::vector<unsigned char>{2}), object("a:b", "k"));
+    EXPECT_EQ(2u, receivedDeltas().size());  // both writes reported PENDING
+
+    transport->onConnectionEstablished();
+    localSave("a:b", "k", {3});
+    std::vector<uint64_t> versions;
+    for (const Delta& delta : transport->sentDeltas()) versions.push_back(delta.versionId);
+    EXPECT_EQ((std::vector<uint64_t>{1, 2, 3}), versions);
 }
 
 TEST_F(DeltaHandlerTest, RemoteDeltasApplyAsPersistedUnlessLocalChangeIsQueued) {

@@ -40,12 +40,14 @@ protected:
     std::vector<std::string> listened;
 };
 
-TEST_F(DeltaQueueTest, AddDeltaQueuesRowAndSendsStampedCopy) {
+TEST_F(DeltaQueueTest, AddDeltaQueuesRowAndOnlyACommittedOneIsSentStamped) {
     Delta delta = remoteSave("a:b", "k", 0);
     delta.clientId = "";
     delta.versionId = 4;
-    EXPECT_EQ(1, deltaQueue->addDelta(delta, Status::PENDING));  // the transport's result, passed back
-    EXPECT_EQ("", delta.clientId);
+    const int64_t queueId = deltaQueue->addDelta(delta, Status::PENDING);
+    EXPECT_TRUE(transport->sentDeltas().empty());
+    deltaQueue->addCommitted(queueId, delta);
+    deltaQueue->sendCommitted();
     auto sent = transport->sentDeltas();
     ASSERT_EQ(1u, sent.size());
     EXPECT_EQ(clientId, sent[0].clientId);

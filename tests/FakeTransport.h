@@ -4,6 +4,7 @@
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <mutex>
 #include <stdexcept>
 #include <string>
@@ -27,11 +28,24 @@ public:
     }
 
     int sendDelta(const Delta& delta) override {
+        std::function<void(const Delta&)> hook;
+        int count = 0;
+        {
+            std::lock_guard<std::mutex> lock(mutex);
+            if (failDeltas) throw std::runtime_error("delta send failed");
+            deltas.push_back(delta);
+            events.push_back("delta " + delta.collectionName + "/" + std::to_string(delta.versionId));
+            count = static_cast<int>(deltas.size());
+            hook = onSend;
+        }
+        if (hook) hook(delta);  // outside the lock: it may write through the store
+        return count;
+    }
+    // Runs on every delta taken, on the sending thread, as a transport's own
+    // code would.
+    void setOnSend(std::function<void(const Delta&)> hook) {
         std::lock_guard<std::mutex> lock(mutex);
-        if (failDeltas) throw std::runtime_error("delta send failed");
-        deltas.push_back(delta);
-        events.push_back("delta " + delta.collectionName + "/" + std::to_string(delta.versionId));
-        return static_cast<int>(deltas.size());
+        onSend = std::move(hook);
     }
 
     void sendSnapshotRequest(const std::string& collectionName, const std::string& clientId) override {
@@ -76,6 +90,7 @@ private:
     std::vector<std::string> events;
     bool failDeltas = false;
     bool failSubscriptions = false;
+    std::function<void(const Delta&)> onSend;
 };
 
 class CountingThreadCreator : public ThreadCreator {

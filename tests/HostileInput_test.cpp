@@ -218,23 +218,19 @@ TEST(HostileInputTest, ThrowingCallbacksIndexersAndTransportLeaveStoredDataAsItW
     };
     ASSERT_EQ(1u, indexed());
 
-    // Replacing the object fails whole when the indexer or the transport
-    // throws: the old object, its index rows and the queue stay as they were.
+    // Replacing the object fails whole when the indexer throws: the old
+    // object, its index rows and the queue stay as they were.
     indexerThrows = true;
     EXPECT_FALSE(items->saveObject("k", "t", Bytes{2}));
     indexerThrows = false;
-    s.transport->setFailDeltas(true);
-    EXPECT_FALSE(items->saveObject("k", "t", Bytes{2}));
-    EXPECT_FALSE(items->deleteObject("k"));
     EXPECT_EQ(1u, log.linesStartingWith("Error while updating object: indexer broke").size());
-    EXPECT_EQ(1u, log.linesStartingWith("Error while updating object: delta send failed").size());
-    EXPECT_EQ(1u, log.linesStartingWith("Error while deleting object: delta send failed").size());
     EXPECT_EQ(stored, objects(items->query("", -1, Direction::ASCENDING)));
     EXPECT_EQ(1u, indexed());
     EXPECT_EQ(1, heardAfterThrowing.load());  // failed writes are not reported
 
     // A transport that throws while the queue is resent loses nothing: the
     // next connection sends the whole queue.
+    s.transport->setFailDeltas(true);
     s.transport->onConnectionEstablished();
     EXPECT_EQ(1u, log.linesStartingWith("Error in DeltaQueue::onConnectionEstablished: delta send failed").size());
     s.transport->setFailDeltas(false);
@@ -244,7 +240,7 @@ TEST(HostileInputTest, ThrowingCallbacksIndexersAndTransportLeaveStoredDataAsItW
     ASSERT_EQ(1u, resent.size());
     EXPECT_EQ(Bytes{1}, resent[0].blob);
     ASSERT_TRUE(items->saveObject("k", "t", Bytes{2}));
-    EXPECT_EQ(5u, s.transport->sentDeltas().back().versionId);  // three failed writes used up ids 2 to 4
+    EXPECT_EQ(3u, s.transport->sentDeltas().back().versionId);  // the failed write used up id 2
 }
 
 }  // namespace

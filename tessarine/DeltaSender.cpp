@@ -1,0 +1,167 @@
+#include "tessarine/DeltaSender.h"
+
+#include <algorithm>
+#include <exception>
+#include <utility>
+#include <vector>
+
+#include "platform/Log.h"
+
+namespace lumivale {
+namespace tessarine {
+
+namespace {
+
+const char* const kResendError = "Error in DeltaQueue::onConnectionEstablished: %s";
+const char* const kLiveSendError = "Transport did not take a change, kept queued for the next connection: %s";
+
+// Hands one delta to the transport; false when the transport threw.
+bool hand(SyncProtocol& syncProtocol, const SyncProtocol::Delta& delta, bool resent) noexcept {
+    const int priority = resent ? 6 : 5;
+    const char* format = resent ? kResendError : kLiveSendError;
+    try {
+        syncProtocol.sendDelta(delta);
+        return true;
+    } catch (const std::exception& e) {
+        lv_printLog(priority, "tessarine", format, e.what());
+    } catch (...) {
+        lv_printLog(priority, "tessarine", format, "an exception of unknown type");
+    }
+    return false;
+}
+
+}  // namespace
+
+DeltaSender::DeltaSender(std::shared_ptr<SyncProtocol> syncProtocol,
+                         std::shared_ptr<DeltaQueueStorage> deltaQueueStorage, std::string clientId)
+    : syncProtocol(std::move(syncProtocol)),
+      deltaQueueStorage(std::move(deltaQueueStorage)),
+      clientId(std::move(clientId)) {}
+
+void DeltaSender::addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexcept {
+    std::lock_guard<std::mutex> lock(mutex);
+    if (queueId > lastCommittedId) lastCommittedId = queueId;
+    // A change the latest resend covers goes out with it, in its place.
+    if (suspended || queueId <= resend.upToId) return;
+    try {
+        delta.clientId = clientId;
+        live.push_back({queueId, std::move(delta)});
+    } catch (const std::exception&) {
+        suspend();
+    }
+}
+
+int64_t DeltaSender::requestResend() {
+    // Read outside the lock: the queue may hold rows that were committed
+    // before this sender was made, and a change committed after this read
+    // has a greater id, so it is added as live and sent after the resend.
+    int64_t storedUpToId = 0;
+    try {
+        storedUpToId = deltaQueueStorage->getLastId();
+    } catch (const std::exception&) {
+        // Without a resend, nothing newer may go out before what is queued.
+        std::lock_guard<std::mutex> lock(mutex);
+        suspend();
+        throw;
+    }
+    std::lock_guard<std::mutex> lock(mutex);
+    ++resend.generation;
+    resend.active = true;
+    resend.upToId = std::max(storedUpToId, lastCommittedId);
+    resend.sentUpToId = 0;
+    suspended = false;
+    live.clear();
+    return resend.upToId;
+}
+
+void DeltaSender::sendWaiting() noexcept {
+    Chunk chunk;
+    std::unique_lock<std::mutex> lock(mutex);
+    if (sending) return;
+    sending = true;
+    for (;;) {
+        Next next = takeNext(chunk);
+        if (next.kind == Next::Kind::NOTHING) return;
+        lock.unlock();
+        if (next.kind == Next::Kind::READ_CHUNK) {
+            readChunk(chunk, next.generation);
+        } else {
+            send(next);
+        }
+        lock.lock();
+    }
+}
+
+DeltaSender::Next DeltaSender::takeNext(Chunk& chunk) {
+    Next next;
+    next.generation = resend.generation;
+    if (resend.active) {
+        if (chunk.generation != resend.generation || chunk.next == chunk.rows.size()) {
+            next.kind = Next::Kind::READ_CHUNK;
+        } else {
+            next.kind = Next::Kind::RESEND;
+            next.queued = std::move(chunk.rows[chunk.next++]);
+        }
+    } else if (!live.empty()) {
+        next.kind = Next::Kind::LIVE;
+        next.queued = std::move(live.front());
+        live.pop_front();
+    } else {
+        sending = false;
+    }
+    return next;
+}
+
+void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
+    int64_t afterId = 0;
+    int64_t upToId = 0;
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        if (resend.generation != generation) return;
+        afterId = resend.sentUpToId;
+        upToId = resend.upToId;
+    }
+    std::vector<DeltaQueueStorage::QueuedDelta> rows;
+    bool failed = false;
+    try {
+        rows = deltaQueueStorage->getDeltasInIdRange(afterId, upToId, kResendChunkSize);
+        for (auto& row : rows) row.delta.clientId = clientId;
+    } catch (const std::exception& e) {
+        lv_printLog(6, "tessarine", kResendError, e.what());
+        failed = true;
+    }
+    std::lock_guard<std::mutex> lock(mutex);
+    if (resend.generation != generation) return;  // a newer resend starts over
+    if (failed) {
+        suspend();
+    } else if (rows.empty()) {
+        resend.active = false;
+    } else {
+        chunk.rows = std::move(rows);
+        chunk.next = 0;
+        chunk.generation = generation;
+    }
+}
+
+void DeltaSender::send(const Next& next) {
+    const bool resent = next.kind == Next::Kind::RESEND;
+    const bool taken = hand(*syncProtocol, next.queued.delta, resent);
+    std::lock_guard<std::mutex> lock(mutex);
+    // After a newer request, what this send did no longer matters: the new
+    // resend carries everything from the start.
+    if (resend.generation != next.generation) return;
+    if (!taken) {
+        suspend();
+    } else if (resent) {
+        resend.sentUpToId = next.queued.id;
+    }
+}
+
+void DeltaSender::suspend() {
+    suspended = true;
+    resend.active = false;
+    live.clear();
+}
+
+}  // namespace tessarine
+}  // namespace lumivale

@@ -1,0 +1,113 @@
+// Hands this store's committed local changes to the transport: each once,
+// in the order in which they were committed, and on every new connection the
+// whole queue again, oldest first, before anything committed later. Each
+// collection's changes therefore reach the transport in version-id order
+// from any number of writing threads, also while a resend is running.
+//
+// A change is handed over only after the transaction that queued it has
+// committed (addCommitted is called after the commit), so a write that
+// failed never reached the transport.
+//
+// One thread at a time hands changes over, outside every lock: whoever calls
+// sendWaiting while nobody is sending becomes the sender and keeps going
+// until nothing waits, also sending what other threads added meanwhile; a
+// call while another thread, or a caller further up this thread's stack, is
+// sending returns at once. So a transport may write through the store from
+// inside sendDelta: that write is sent after the change being sent now.
+//
+// A sendDelta that throws means the transport did not take the change. It
+// is logged (priority 5; priority 6 during a resend) and nothing more is
+// handed over until the next connection, whose resend carries every queued
+// change in order: sending later changes first would let the server see a
+// newer change of an object before an older one.
+//
+// Threads: every operation may be called from any thread. Locks: mutex is a
+// leaf, held only to look at or change the waiting work, never while the
+// transport or the storage is called.
+#pragma once
+
+#include <cstdint>
+#include <deque>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "tessarine/DeltaQueueStorage.h"
+#include "tessarine/SyncProtocol.h"
+
+namespace lumivale {
+namespace tessarine {
+
+class DeltaSender {
+public:
+    // The queued deltas a resend reads at a time, so that its memory stays
+    // flat however long the queue is.
+    static constexpr int kResendChunkSize = 256;
+
+    DeltaSender(std::shared_ptr<SyncProtocol> syncProtocol, std::shared_ptr<DeltaQueueStorage> deltaQueueStorage,
+                std::string clientId);
+    DeltaSender(const DeltaSender&) = delete;
+    DeltaSender& operator=(const DeltaSender&) = delete;
+
+    // A change whose queue row (queueId) has just committed. Callers add in
+    // commit order: the local write lock orders them. Never throws: a change
+    // that cannot wait here stays queued for the next connection.
+    void addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexcept;
+
+    // A new connection: every change committed so far goes out again, oldest
+    // first, before anything committed later; a resend under way starts
+    // over. Sending resumes if a failure had stopped it. Returns the highest
+    // queue id the resend covers. Throws what reading the queue throws; then
+    // nothing is handed over until the next request.
+    int64_t requestResend();
+
+    // Hands over what waits, on the calling thread, unless somebody is
+    // already doing so. Never throws.
+    void sendWaiting() noexcept;
+
+private:
+    // What a resend has read and not sent yet; the sending thread's own.
+    struct Chunk {
+        std::vector<DeltaQueueStorage::QueuedDelta> rows;
+        size_t next = 0;
+        uint64_t generation = 0;
+    };
+
+    // The latest resend, read and changed under mutex. Every id up to upToId
+    // is its to send, whether it is still running or not.
+    struct Resend {
+        bool active = false;
+        uint64_t generation = 0;  // counts requests; a newer one restarts
+        int64_t upToId = 0;       // the last id committed when requested
+        int64_t sentUpToId = 0;   // how far it has got
+    };
+    // One step of the sending thread, taken under mutex.
+    struct Next {
+        enum class Kind { NOTHING, READ_CHUNK, RESEND, LIVE } kind = Kind::NOTHING;
+        uint64_t generation = 0;
+        DeltaQueueStorage::QueuedDelta queued;
+    };
+
+    // Chooses the next step; mutex is held. Clears sending when there is
+    // nothing left, so that a change added later finds nobody sending.
+    Next takeNext(Chunk& chunk);
+    void readChunk(Chunk& chunk, uint64_t generation);
+    void send(const Next& next);
+    // Stops handing over until the next resend; mutex is held.
+    void suspend();
+
+    std::shared_ptr<SyncProtocol> syncProtocol;
+    std::shared_ptr<DeltaQueueStorage> deltaQueueStorage;
+    std::string clientId;
+
+    std::mutex mutex;
+    std::deque<DeltaQueueStorage::QueuedDelta> live;  // committed, not yet handed over
+    Resend resend;
+    int64_t lastCommittedId = 0;
+    bool sending = false;    // a thread is handing over
+    bool suspended = false;  // a send failed; wait for the next connection
+};
+
+}  // namespace tessarine
+}  // namespace lumivale

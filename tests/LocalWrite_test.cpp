@@ -1,0 +1,210 @@
+// The local write path as an application meets it: a change reaches the
+// transport only after it has committed, in version-id order, and code that
+// the store calls (transport, callbacks, indexer) may write through the store
+// without hanging it. Each case runs while another thread writes too, under a
+// watchdog, so a deadlock fails the test instead of stalling the run.
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <map>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "FaultyVfs.h"
+#include "StoreTestSupport.h"
+#include "Watchdog.h"
+
+namespace {
+
+namespace ts = lumivale::tessarine;
+using Bytes = std::vector<unsigned char>;
+using testsupport::FaultyVfs;
+using testsupport::LogCapture;
+using testsupport::waitUntil;
+
+const char* const kRefusedWrite =
+    "Error while updating object: a change cannot be written from code that the store runs inside its own "
+    "transaction (an indexer)";
+
+class LocalWriteTest : public ::testing::Test {
+protected:
+    // Writes into "app:others" on a thread of its own until destroyed.
+    class BackgroundWriter {
+    public:
+        explicit BackgroundWriter(ts::Collection& collection)
+            : thread([this, &collection] {
+                  for (int i = 0; !stop; ++i) {
+                      if (collection.saveObject("bg-" + std::to_string(i), "s", Bytes{1})) ++written;
+                  }
+              }) {}
+        ~BackgroundWriter() {
+            waitUntil([this] { return written.load() > 0; });
+            stop = true;
+            thread.join();
+        }
+
+    private:
+        std::atomic<bool> stop{false};
+        std::atomic<int> written{0};
+        std::thread thread;
+    };
+
+    void withWriterAndWatchdog(const std::function<void()>& body) {
+        testsupport::runWithWatchdog("a write from code the store calls", std::chrono::seconds(60), [&] {
+            BackgroundWriter writer(*others);
+            body();
+        });
+    }
+
+    bool stored(const std::string& key) {
+        auto cursor = items->getObject(key);
+        return cursor && cursor->step();
+    }
+
+    // The versions of one collection's deltas, in the order the transport got them.
+    std::vector<uint64_t> sentVersions(const std::string& collection) {
+        std::vector<uint64_t> versions;
+        for (const auto& delta : s.transport->sentDeltas()) {
+            if (delta.collectionName == collection) versions.push_back(delta.versionId);
+        }
+        return versions;
+    }
+
+    ts::SyncProtocol::Delta remoteSave(const std::string& key) {
+        ts::SyncProtocol::Delta delta;
+        delta.clientId = "OTHERCLIENT";
+        delta.collectionName = "app:items";
+        delta.versionId = 1;
+        delta.type = ts::SyncProtocol::DeltaType::SAVE;
+        delta.primaryKey = key;
+        delta.blob = {4};
+        delta.sequenceNumber = 1;
+        return delta;
+    }
+
+    FaultyVfs vfs;  // first: the store opens its file through it
+    testsupport::TempDir dir;
+    testsupport::StoreUnderTest s{dir.file("store.db")};
+    std::unique_ptr<ts::Collection> items = s.store->subscribeCollection("app:items");
+    std::unique_ptr<ts::Collection> others = s.store->subscribeCollection("app:others");
+};
+
+TEST_F(LocalWriteTest, WritesFromTheTransportAndFromCallbacksWorkCompletelyAndKeepVersionOrder) {
+    std::atomic<bool> fromSend{false}, fromLocalCallback{false}, fromWorkerCallback{false};
+    s.transport->setOnSend([&](const ts::SyncProtocol::Delta& delta) {
+        if (delta.primaryKey == "a") fromSend = items->saveObject("from-send", "s", Bytes{2});
+    });
+    s.store->addDeltaReceivedCallback([&](const std::vector<ts::Delta>& deltas) {
+        const ts::Delta& delta = deltas.front();
+        if (delta.primaryKey == "b" && delta.status == ts::SyncProtocol::DeltaStatus::PENDING) {
+            fromLocalCallback = items->saveObject("from-callback", "s", Bytes{3});
+        } else if (delta.primaryKey == "remote") {
+            fromWorkerCallback = items->saveObject("from-worker", "s", Bytes{5});
+        }
+    });
+    withWriterAndWatchdog([&] {
+        ASSERT_TRUE(items->saveObject("a", "s", Bytes{1}));
+        ASSERT_TRUE(items->saveObject("b", "s", Bytes{1}));
+        s.transport->onDeltaReceived({remoteSave("remote")});
+        ASSERT_TRUE(waitUntil([&] { return stored("from-worker"); }));
+    });
+    EXPECT_TRUE(fromSend && fromLocalCallback && fromWorkerCallback);
+    // Each handed over once, after the change being sent when it was made.
+    EXPECT_EQ((std::vector<uint64_t>{1, 2, 3, 4, 5}), sentVersions("app:items"));
+    for (const char* key : {"a", "b", "from-send", "from-callback", "from-worker", "remote"}) {
+        EXPECT_TRUE(stored(key)) << key;
+    }
+}
+
+TEST_F(LocalWriteTest, WritesFromTheIndexerAreRefusedAtOnceOnLocalSavesAndDeliveries) {
+    std::atomic<int> refused{0};
+    s.store->setCollectionIndexerFunction([&](const std::string& collection, const std::string& key,
+                                              const std::string&, const Bytes&) {
+        if (collection == "app:items" && !items->saveObject("from-indexer-" + key, "s", Bytes{1})) ++refused;
+        return std::unordered_multimap<std::string, std::string>{};
+    });
+    LogCapture log;
+    withWriterAndWatchdog([&] {
+        EXPECT_TRUE(items->saveObject("local", "s", Bytes{1}));
+        s.transport->onDeltaReceived({remoteSave("remote")});
+        ASSERT_TRUE(waitUntil([&] { return stored("remote"); }));
+    });
+    EXPECT_EQ(2, refused.load());
+    auto lines = log.linesStartingWith(kRefusedWrite);
+    ASSERT_EQ(2u, lines.size());
+    EXPECT_EQ(6, lines[0].priority);
+    EXPECT_FALSE(stored("from-indexer-local") || stored("from-indexer-remote"));
+    EXPECT_EQ((std::vector<uint64_t>{1}), sentVersions("app:items"));
+    s.store->setCollectionIndexerFunction(nullptr);
+    EXPECT_TRUE(items->saveObject("after", "s", Bytes{1}));  // the store still works
+}
+
+// Most storage failures surface only at COMMIT, after everything the write
+// does has run: the change must not have been handed over by then.
+TEST_F(LocalWriteTest, WriteWhoseCommitFailsNeverReachesTheTransport) {
+    for (FaultyVfs::Fault fault : {FaultyVfs::Fault::IO_ERROR, FaultyVfs::Fault::DISK_FULL}) {
+        // The indexer runs inside the write's transaction, after its version
+        // id has committed: the next write to disk is the COMMIT.
+        s.store->setCollectionIndexerFunction([&](const std::string&, const std::string& key, const std::string&,
+                                                  const Bytes&) {
+            if (key == "doomed") FaultyVfs::inject(fault);
+            return std::unordered_multimap<std::string, std::string>{};
+        });
+        s.transport->clearSent();
+        LogCapture log;
+        EXPECT_FALSE(items->saveObject("doomed", "s", Bytes{1}));
+        FaultyVfs::inject(FaultyVfs::Fault::NONE);
+        EXPECT_EQ(1u, log.linesStartingWith("Error while updating object: ").size());
+        EXPECT_TRUE(s.transport->sentDeltas().empty());
+        EXPECT_FALSE(stored("doomed"));
+        s.transport->onConnectionEstablished();  // nor was it queued for a resend
+        for (const auto& delta : s.transport->sentDeltas()) EXPECT_NE("doomed", delta.primaryKey);
+        EXPECT_TRUE(items->saveObject("fine", "s", Bytes{1}));
+        EXPECT_TRUE(stored("fine"));
+    }
+}
+
+// Writers on several threads and resends on connection at once: a new
+// change must never overtake older ones that a resend has not sent yet.
+// Nothing is ever persisted here, so every resend starts at version 1 and
+// each collection's versions at the transport run 1, 2, 3... from there.
+TEST_F(LocalWriteTest, EachCollectionReachesTheTransportInVersionOrderWhileResendsRun) {
+    constexpr int kWriters = 3;
+#ifdef TESSARINE_TEST_EMULATED
+    constexpr int kWritesEach = 40;
+#else
+    constexpr int kWritesEach = 150;
+#endif
+    testsupport::runWithWatchdog("writers racing resends", std::chrono::seconds(120), [&] {
+        std::atomic<int> writersDone{0};
+        std::vector<std::thread> writers;
+        for (int w = 0; w < kWriters; ++w) {
+            writers.emplace_back([&, w] {
+                for (int i = 0; i < kWritesEach; ++i) {
+                    ts::Collection& target = (i % 2 == 0) ? *items : *others;
+                    EXPECT_TRUE(target.saveObject(std::to_string(w) + "-" + std::to_string(i), "s", Bytes{1}));
+                }
+                ++writersDone;
+            });
+        }
+        std::thread connections([&] {
+            while (writersDone < kWriters) s.transport->onConnectionEstablished();
+        });
+        for (auto& writer : writers) writer.join();
+        connections.join();
+    });
+    s.transport->onConnectionEstablished();  // a last, complete resend
+    for (const char* collection : {"app:items", "app:others"}) {
+        std::vector<uint64_t> versions = sentVersions(collection);
+        uint64_t previous = 0;
+        for (size_t i = 0; i < versions.size(); ++i) {
+            ASSERT_TRUE(versions[i] == previous + 1 || versions[i] == 1)
+                << collection << ": version " << versions[i] << " after " << previous << " at " << i;
+            previous = versions[i];
+        }
+        EXPECT_EQ(kWriters * kWritesEach / 2, static_cast<int>(previous)) << collection;
+    }
+}
+
+}  // namespace
