@@ -27,7 +27,10 @@ Connection::Connection(const std::string& path, int flags) {
     sqlite3_extended_result_codes(db, 1);
 }
 
-Connection::~Connection() { sqlite3_close_v2(db); }
+Connection::~Connection() {
+    cache.clear();
+    sqlite3_close_v2(db);
+}
 
 void Connection::fail(int code, const std::string& context) const {
     throw SQLiteException(code, sqlite3_errmsg(db), context);
@@ -36,6 +39,28 @@ void Connection::fail(int code, const std::string& context) const {
 void Connection::exec(const std::string& sql) {
     int rc = sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr);
     if (rc != SQLITE_OK) fail(rc, "executing: " + sql);
+}
+
+void Connection::execCached(const std::string& sql) {
+    sqlite3_stmt* statement = cache.take(sql);
+    if (statement == nullptr) {
+        int rc = sqlite3_prepare_v2(db, sql.c_str(), static_cast<int>(sql.size()), &statement, nullptr);
+        if (rc != SQLITE_OK) fail(rc, "executing: " + sql);
+        ++compiledCount;
+        if (statement == nullptr) return;  // no statement in the text
+    }
+    int rc = sqlite3_step(statement);
+    if (rc == SQLITE_DONE || rc == SQLITE_ROW) {
+        cache.give(statement);
+        return;
+    }
+    // The message must be read before give() resets the statement.
+    try {
+        fail(rc, "executing: " + sql);
+    } catch (...) {
+        cache.give(statement);
+        throw;
+    }
 }
 
 }  // namespace sqlite

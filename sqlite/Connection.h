@@ -1,6 +1,7 @@
 // Internal to the SQLite access layer: the one sqlite3 handle of a Database,
-// the recursive mutex that serialises every call on it, and the depth of the
-// transaction that the mutex's owner has open.
+// the recursive mutex that serialises every call on it, the depth of the
+// transaction that the mutex's owner has open, and the cache of its idle
+// compiled statements.
 //
 // Database and every Statement prepared from it share the Connection, so a
 // statement that outlives its Database (a cursor the application still holds)
@@ -9,9 +10,12 @@
 #pragma once
 
 #include <atomic>
+#include <cstdint>
 #include <mutex>
 #include <string>
 #include <thread>
+
+#include "sqlite/StatementCache.h"
 
 struct sqlite3;
 
@@ -33,6 +37,13 @@ public:
 
     // Runs SQL that may return rows (which are discarded); throws on error.
     void exec(const std::string& sql);
+    // Runs one statement that returns no rows, compiled once and then taken
+    // from the cache (BEGIN, COMMIT and the like); throws on error.
+    void execCached(const std::string& sql);
+
+    StatementCache& statements() { return cache; }
+    // Statements compiled on this connection so far (cache hits excluded).
+    uint64_t compiledCount = 0;
 
     // Transactions nest: depth 0 means autocommit. Owned by the thread that
     // holds mutex() for the whole of the outermost transaction.
@@ -45,6 +56,7 @@ public:
 private:
     sqlite3* db = nullptr;
     std::recursive_mutex lock;
+    StatementCache cache;
 };
 
 }  // namespace sqlite

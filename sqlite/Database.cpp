@@ -49,10 +49,10 @@ private:
 void rollbackLevel(Connection& connection, int depth) {
     try {
         if (depth == 0) {
-            if (!sqlite3_get_autocommit(connection.handle())) connection.exec("ROLLBACK");
+            if (!sqlite3_get_autocommit(connection.handle())) connection.execCached("ROLLBACK");
         } else {
-            connection.exec("ROLLBACK TO " + savepointName(depth));
-            connection.exec("RELEASE " + savepointName(depth));
+            connection.execCached("ROLLBACK TO " + savepointName(depth));
+            connection.execCached("RELEASE " + savepointName(depth));
         }
     } catch (const SQLiteException&) {
     }
@@ -100,6 +100,11 @@ bool Database::isInTransactionOnThisThread() const {
     return connection->transactionOwner.load() == std::this_thread::get_id();
 }
 
+uint64_t Database::compiledStatementCount() const {
+    std::lock_guard<std::recursive_mutex> lock(connection->mutex());
+    return connection->compiledCount;
+}
+
 long long Database::lastInsertRowId() const {
     std::lock_guard<std::recursive_mutex> lock(connection->mutex());
     return sqlite3_last_insert_rowid(connection->handle());
@@ -107,10 +112,12 @@ long long Database::lastInsertRowId() const {
 
 Statement Database::prepare(const std::string& sql) {
     std::lock_guard<std::recursive_mutex> lock(connection->mutex());
+    if (sqlite3_stmt* cached = connection->statements().take(sql)) return Statement(connection, cached);
     sqlite3_stmt* statement = nullptr;
     const char* tail = nullptr;
     int rc = sqlite3_prepare_v2(connection->handle(), sql.c_str(), static_cast<int>(sql.size()), &statement, &tail);
     if (rc != SQLITE_OK) connection->fail(rc, "preparing: " + sql);
+    ++connection->compiledCount;
     Statement prepared(connection, statement);
     // SQLite compiles the first statement and silently ignores the rest of
     // the text. Text meant as one statement (an application's index
@@ -126,7 +133,7 @@ void Database::runInTransaction(const std::function<void()>& fn, TransactionType
     std::lock_guard<std::recursive_mutex> lock(connection->mutex());
     Connection& c = *connection;
     const int depth = c.transactionDepth;
-    c.exec(depth == 0 ? std::string(beginSql(type)) : "SAVEPOINT " + savepointName(depth));
+    c.execCached(depth == 0 ? std::string(beginSql(type)) : "SAVEPOINT " + savepointName(depth));
     OpenLevel level(c, depth);
     try {
         fn();
@@ -135,7 +142,7 @@ void Database::runInTransaction(const std::function<void()>& fn, TransactionType
         throw;
     }
     try {
-        c.exec(depth == 0 ? std::string("COMMIT") : "RELEASE " + savepointName(depth));
+        c.execCached(depth == 0 ? std::string("COMMIT") : "RELEASE " + savepointName(depth));
     } catch (const SQLiteException&) {
         rollbackLevel(c, depth);
         throw;

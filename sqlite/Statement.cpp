@@ -36,7 +36,7 @@ Statement::~Statement() { finalize(); }
 void Statement::finalize() noexcept {
     if (statement == nullptr) return;
     Lock lock(connection->mutex());
-    sqlite3_finalize(statement);
+    connection->statements().give(statement);
     statement = nullptr;
 }
 

@@ -1,8 +1,9 @@
 // A prepared statement of a Database, and the column handle that reads its
 // current row.
 //
-// Movable, not copyable; the destructor finalises the statement, and a
-// moved-from Statement owns nothing and finalises nothing. Parameter indexes
+// Movable, not copyable; the destructor gives the compiled statement back to
+// its connection's cache (reset, bindings cleared) for the next prepare of
+// the same SQL, and a moved-from Statement owns nothing and gives nothing. Parameter indexes
 // start at 1, column indexes at 0, as in SQLite.
 //
 // Threads: every call takes the connection's mutex, so statements of one

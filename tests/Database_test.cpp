@@ -10,6 +10,7 @@
 #include "TestSupport.h"
 #include "sqlite/Database.h"
 #include "sqlite/SQLiteException.h"
+#include "sqlite/StatementCache.h"
 
 using lumivale::sqlite::Database;
 using lumivale::sqlite::SQLiteException;
@@ -287,6 +288,82 @@ TEST_F(DatabaseTest, ErrorsCarrySqliteMessageAndStatement) {
         insert("dup");
     }, kImmediate), SQLiteException);
     EXPECT_FALSE(has("new"));
+}
+
+}  // namespace
+
+namespace {
+
+// Compiling a statement costs more than running it; the connection keeps idle
+// statements and hands them out again, never one that is still in use.
+class StatementCacheTest : public DatabaseTest {
+protected:
+    uint64_t compiled() { return db->compiledStatementCount(); }
+};
+
+TEST_F(StatementCacheTest, IdleStatementsAreReusedWithFreshBindingsAndTransactionsCompileOnce) {
+    insert("a");
+    const uint64_t afterFirst = compiled();
+    insert("b");
+    db->runInTransaction([&] { insert("c"); }, kImmediate);
+    const uint64_t afterTransaction = compiled();
+    db->runInTransaction([&] { insert("d"); }, kImmediate);
+    EXPECT_EQ(afterFirst + 2, afterTransaction);  // BEGIN IMMEDIATE and COMMIT, once
+    EXPECT_EQ(afterTransaction, compiled());
+    EXPECT_EQ(4, count());
+
+    Statement bound = db->prepare("SELECT ? IS NULL");
+    bound.bind(1, 5);
+    bound = db->prepare("SELECT 0");  // gives the first back
+    Statement reused = db->prepare("SELECT ? IS NULL");
+    ASSERT_TRUE(reused.step());
+    EXPECT_EQ(1, reused(0).getInt());  // the earlier binding did not stay
+}
+
+TEST_F(StatementCacheTest, StatementInUseIsNeverHandedOutTwice) {
+    insert("a");
+    insert("b");
+    const std::string sql = "SELECT k FROM t ORDER BY k";
+    Statement first = db->prepare(sql);
+    ASSERT_TRUE(first.step());
+    const uint64_t before = compiled();
+    Statement second = db->prepare(sql);  // an open cursor holds the first
+    EXPECT_EQ(before + 1, compiled());
+    ASSERT_TRUE(second.step());
+    ASSERT_TRUE(first.step());
+    EXPECT_EQ("b", first(0).getText());
+    EXPECT_EQ("a", second(0).getText());
+    first = db->prepare("SELECT 1");
+    second = db->prepare("SELECT 1");
+    Statement third = db->prepare(sql);
+    Statement fourth = db->prepare(sql);
+    EXPECT_EQ(before + 3, compiled());  // "SELECT 1" twice; both of sql's came back
+}
+
+TEST_F(StatementCacheTest, CachedStatementFollowsSchemaChanges) {
+    db->exec("CREATE TABLE u (a INTEGER)");
+    db->exec("INSERT INTO u VALUES (1)");
+    auto sum = [&] {
+        Statement s = db->prepare("SELECT total(a) FROM u");
+        s.step();
+        return s(0).getInt();
+    };
+    EXPECT_EQ(1, sum());
+    db->exec("DROP TABLE u");
+    db->exec("CREATE TABLE u (b TEXT, a INTEGER)");
+    db->exec("INSERT INTO u VALUES ('x', 7)");
+    EXPECT_EQ(7, sum());  // recompiled against the new table, not its old layout
+}
+
+TEST_F(StatementCacheTest, LeastRecentlyUsedTextsAreEvictedPastTheBound) {
+    const int texts = static_cast<int>(lumivale::sqlite::StatementCache::kMaxIdleStatements) + 8;
+    auto select = [](int i) { return "SELECT " + std::to_string(i); };
+    for (int i = 0; i < texts; ++i) db->prepare(select(i));
+    const uint64_t before = compiled();
+    db->prepare(select(texts - 1));  // recent: still cached
+    EXPECT_EQ(before, compiled());
+    db->prepare(select(0));  // oldest: evicted and compiled again
+    EXPECT_EQ(before + 1, compiled());
 }
 
 }  // namespace
