@@ -137,7 +137,9 @@ void DeltaHandler::onLifecycleStop() { stopped = true; }
 void DeltaHandler::processDelivery(const std::vector<SyncProtocol::Delta>& deltas) {
     try {
         database->runInTransaction([&] {
-            for (const SyncProtocol::Delta& delta : deltas) processIncomingDelta(delta);
+            DeliveryMarks marks;
+            for (const SyncProtocol::Delta& delta : deltas) processIncomingDelta(delta, marks);
+            storeDeliveryMarks(marks);
         }, kImmediate);
     } catch (const std::exception& e) {
         lv_printLog(5, "tessarine", "Failed to process received deltas: %s", e.what());
@@ -157,11 +159,12 @@ void DeltaHandler::processStatusUpdate(const SyncProtocol::Delta& delta, SyncPro
     callDeltaCallbacks({delta}, status);
 }
 
-void DeltaHandler::processIncomingDelta(const SyncProtocol::Delta& delta) {
+void DeltaHandler::processIncomingDelta(const SyncProtocol::Delta& delta, DeliveryMarks& marks) {
+    marks.sequenceNumbers[delta.collectionName] = delta.sequenceNumber;
     if (delta.clientId == clientId) {
         processIncomingOwnDelta(delta);
     } else {
-        processIncomingRemoteDelta(delta);
+        processIncomingRemoteDelta(delta, marks);
     }
 }
 
@@ -169,15 +172,23 @@ void DeltaHandler::processIncomingOwnDelta(const SyncProtocol::Delta& delta) {
     if (deltaQueue->updateDeltaStatus(delta, SyncProtocol::DeltaStatus::PERSISTED) == DeltaQueue::QUEUE_CHANGED) {
         recalculateAndUpdateObjectStatus(delta);
     }
-    subscriptionManager->updateSequenceNumber(delta.collectionName, delta.sequenceNumber);
 }
 
-void DeltaHandler::processIncomingRemoteDelta(const SyncProtocol::Delta& delta) {
-    subscriptionManager->updateSequenceNumber(delta.collectionName, delta.sequenceNumber);
-    versionVectorStorage->updateCollectionVersionVector(delta.collectionName, delta.clientId, delta.versionId);
+void DeltaHandler::processIncomingRemoteDelta(const SyncProtocol::Delta& delta, DeliveryMarks& marks) {
+    uint64_t& highest = marks.highestVersions[{delta.collectionName, delta.clientId}];
+    if (delta.versionId > highest) highest = delta.versionId;
     // An outstanding local change of the object wins until it is persisted.
     if (deltaQueue->getPendingStatus(delta.collectionName, delta.primaryKey) == DeltaQueue::PendingStatus::PERSISTED) {
         applyDelta(delta, CollectionStorage::ObjectStatus::PERSISTED);
+    }
+}
+
+void DeltaHandler::storeDeliveryMarks(const DeliveryMarks& marks) {
+    for (const auto& [collection, sequenceNumber] : marks.sequenceNumbers) {
+        subscriptionManager->updateSequenceNumber(std::string(collection), sequenceNumber);
+    }
+    for (const auto& [key, versionId] : marks.highestVersions) {
+        versionVectorStorage->updateCollectionVersionVector(std::string(key.first), std::string(key.second), versionId);
     }
 }
 

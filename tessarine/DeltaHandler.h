@@ -26,9 +26,12 @@
 #pragma once
 
 #include <atomic>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <string>
+#include <string_view>
+#include <utility>
 #include <vector>
 
 #include "tessarine/CollectionStorage.h"
@@ -78,10 +81,22 @@ public:
     void onDeltaStatusUpdated(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     void onLifecycleStop();
 
-    // One incoming delta, inside the caller's transaction.
-    void processIncomingDelta(const SyncProtocol::Delta& delta);
+    // What a delivery moves forward: per collection the sequence number of
+    // its last delta, per (collection, writing client) the highest version
+    // id. Stored once each when the delivery's deltas have been applied,
+    // inside the same transaction, instead of once per delta. The views
+    // point into the delivery, which outlives the marks.
+    struct DeliveryMarks {
+        std::map<std::string_view, uint64_t> sequenceNumbers;
+        std::map<std::pair<std::string_view, std::string_view>, uint64_t> highestVersions;
+    };
+
+    // One incoming delta, inside the caller's transaction; its sequence
+    // number and version go into marks.
+    void processIncomingDelta(const SyncProtocol::Delta& delta, DeliveryMarks& marks);
     void processIncomingOwnDelta(const SyncProtocol::Delta& delta);
-    void processIncomingRemoteDelta(const SyncProtocol::Delta& delta);
+    void processIncomingRemoteDelta(const SyncProtocol::Delta& delta, DeliveryMarks& marks);
+    void storeDeliveryMarks(const DeliveryMarks& marks);
     void applyDelta(const SyncProtocol::Delta& delta, CollectionStorage::ObjectStatus status);
     void recalculateAndUpdateObjectStatus(const SyncProtocol::Delta& delta);
     CollectionStorage::ObjectStatus convToObjectStatus(DeltaQueue::PendingStatus pendingStatus);

@@ -88,6 +88,30 @@ TEST_F(DeltaHandlerTest, RemoteDeltasApplyAsPersistedUnlessLocalChangeIsQueued) 
     EXPECT_EQ(0, object("a:b", "theirs").first);
 }
 
+// Sequence numbers and version vectors are stored once per delivery, not per
+// delta; what they hold afterwards must be what a delta-by-delta update gives.
+TEST_F(DeltaHandlerTest, DeliveryOverSeveralCollectionsAndClientsStoresEachOnesLastSequenceAndHighestVersion) {
+    subscriptionManager->subscribeCollection("a:c");
+    collectionStorage->ensureTableExistsForCollection("a:c");
+    auto from = [&](const std::string& client, const std::string& collection, uint64_t version, uint64_t sequence) {
+        Delta delta = remoteSave(collection, "k" + std::to_string(sequence), sequence);
+        delta.clientId = client;
+        delta.versionId = version;
+        return delta;
+    };
+    Delta own = localSave("a:c", "mine");
+    deliver({from("X", "a:b", 5, 30), from("Y", "a:b", 9, 31), from("X", "a:c", 2, 7), from("X", "a:b", 4, 32),
+             from("Y", "a:b", 12, 33), echo(own, 8)});
+    EXPECT_EQ(33u, subscriptionManager->getSequenceNumber("a:b"));
+    EXPECT_EQ(8u, subscriptionManager->getSequenceNumber("a:c"));  // an own delta moves it too
+    EXPECT_EQ(5u, versionVectorStorage->getCollectionVersion("a:b", "X"));  // highest, not last
+    EXPECT_EQ(12u, versionVectorStorage->getCollectionVersion("a:b", "Y"));
+    EXPECT_EQ(2u, versionVectorStorage->getCollectionVersion("a:c", "X"));
+    EXPECT_EQ(0u, versionVectorStorage->getCollectionVersion("a:c", clientId));
+    deliver({from("X", "a:b", 3, 34)});  // lower than stored: kept
+    EXPECT_EQ(5u, versionVectorStorage->getCollectionVersion("a:b", "X"));
+}
+
 TEST_F(DeltaHandlerTest, OwnEchoRetiresQueueRowWithoutRewritingObject) {
     Delta first = localSave("a:b", "k", {1});
     Delta second = localSave("a:b", "k", {2});
