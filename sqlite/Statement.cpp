@@ -66,14 +66,26 @@ void Statement::bind(int index, long long value) {
     if (rc != SQLITE_OK) fail(rc, "binding");
 }
 
-void Statement::bind(int index, const std::string& value) {
+void Statement::bind(int index, const std::string& value) { bindText(index, value, SQLITE_TRANSIENT); }
+
+void Statement::bindWithoutCopy(int index, const std::string& value) { bindText(index, value, SQLITE_STATIC); }
+
+void Statement::bindBlob(int index, const unsigned char* data, unsigned int size) {
+    bindBytes(index, data, size, SQLITE_TRANSIENT);
+}
+
+void Statement::bindBlobWithoutCopy(int index, const unsigned char* data, unsigned int size) {
+    bindBytes(index, data, size, SQLITE_STATIC);
+}
+
+void Statement::bindText(int index, const std::string& value, void (*lifetime)(void*)) {
     sqlite3_stmt* s = checkedHandle("binding");
     Lock lock(connection->mutex());
-    int rc = sqlite3_bind_text64(s, index, value.data(), value.size(), SQLITE_TRANSIENT, SQLITE_UTF8);
+    int rc = sqlite3_bind_text64(s, index, value.data(), value.size(), lifetime, SQLITE_UTF8);
     if (rc != SQLITE_OK) fail(rc, "binding");
 }
 
-void Statement::bindBlob(int index, const unsigned char* data, unsigned int size) {
+void Statement::bindBytes(int index, const unsigned char* data, unsigned int size, void (*lifetime)(void*)) {
     sqlite3_stmt* s = checkedHandle("binding");
     if (data == nullptr && size != 0) {
         throw SQLiteException(SQLITE_MISUSE, "blob of " + std::to_string(size) + " bytes without data",
@@ -82,8 +94,7 @@ void Statement::bindBlob(int index, const unsigned char* data, unsigned int size
     Lock lock(connection->mutex());
     // sqlite3_bind_blob turns a null pointer into NULL; an empty payload is
     // stored as an empty blob instead.
-    int rc = size == 0 ? sqlite3_bind_zeroblob(s, index, 0)
-                       : sqlite3_bind_blob64(s, index, data, size, SQLITE_TRANSIENT);
+    int rc = size == 0 ? sqlite3_bind_zeroblob(s, index, 0) : sqlite3_bind_blob64(s, index, data, size, lifetime);
     if (rc != SQLITE_OK) fail(rc, "binding");
 }
 

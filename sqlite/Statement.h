@@ -58,6 +58,11 @@ public:
     // A BLOB of size bytes, copied at bind time. (nullptr, 0) binds an empty
     // blob, not NULL.
     void bindBlob(int index, const unsigned char* data, unsigned int size);
+    // As bind and bindBlob, without the copy: SQLite reads the caller's
+    // bytes, which must stay alive and unchanged until the statement is
+    // reset or destroyed. For values written at once by one step.
+    void bindWithoutCopy(int index, const std::string& value);
+    void bindBlobWithoutCopy(int index, const unsigned char* data, unsigned int size);
 
     // True when a row is current; false once the statement has run to its
     // end, and on every further call until reset().
@@ -70,6 +75,9 @@ private:
     friend class Database;
     Statement(std::shared_ptr<Connection> connection, sqlite3_stmt* statement);
 
+    // lifetime is SQLite's destructor argument: SQLITE_TRANSIENT copies.
+    void bindText(int index, const std::string& value, void (*lifetime)(void*));
+    void bindBytes(int index, const unsigned char* data, unsigned int size, void (*lifetime)(void*));
     sqlite3_stmt* checkedHandle(const char* action) const;
     [[noreturn]] void fail(int code, const char* action) const;
     void finalize() noexcept;

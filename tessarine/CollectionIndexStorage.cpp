@@ -22,11 +22,13 @@ void CollectionIndexStorage::ensureTableExistsForCollection(const std::string& c
 void CollectionIndexStorage::saveObject(const std::string& collectionName, const std::string& primaryKey,
                                         const std::unordered_multimap<std::string, std::string>& fields) {
     deleteObject(collectionName, primaryKey);
+    if (fields.empty()) return;
     auto statement = database->prepare(dbqueries::CollectionIndexSaveObject::getSql(getTableName(collectionName)));
+    // The values outlive each step that writes them.
+    statement.bindWithoutCopy(1, primaryKey);
     for (const auto& field : fields) {
-        statement.bind(1, primaryKey);
-        statement.bind(2, field.first);
-        statement.bind(3, field.second);
+        statement.bindWithoutCopy(2, field.first);
+        statement.bindWithoutCopy(3, field.second);
         statement.step();
         statement.reset();
     }

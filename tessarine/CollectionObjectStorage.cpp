@@ -46,9 +46,10 @@ void CollectionObjectStorage::saveObject(const std::string& collectionName, cons
                                          const std::string& sortKey, const unsigned char* blob,
                                          unsigned int blobSize, CollectionStorage::ObjectStatus status) {
     auto statement = database->prepare(dbqueries::SaveObject::getSql(getTableName(collectionName)));
-    statement.bind(1, primaryKey);
-    statement.bind(2, sortKey);
-    statement.bindBlob(3, blob, blobSize);
+    // The values outlive the one step that writes them.
+    statement.bindWithoutCopy(1, primaryKey);
+    statement.bindWithoutCopy(2, sortKey);
+    statement.bindBlobWithoutCopy(3, blob, blobSize);
     statement.bind(4, static_cast<int>(status));
     statement.step();
 }

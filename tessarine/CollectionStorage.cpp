@@ -99,12 +99,27 @@ std::unique_ptr<Cursor> CollectionStorage::getObject(const std::string& collecti
 void CollectionStorage::saveObject(const std::string& collectionName, const std::string& primaryKey,
                                    const std::string& sortKey, const unsigned char* blob, unsigned int blobSize,
                                    ObjectStatus status) {
+    writeObject(collectionName, primaryKey, sortKey, blob, blobSize, nullptr, status);
+}
+
+void CollectionStorage::saveObject(const std::string& collectionName, const std::string& primaryKey,
+                                   const std::string& sortKey, const std::vector<unsigned char>& blob,
+                                   ObjectStatus status) {
+    writeObject(collectionName, primaryKey, sortKey, blob.data(), static_cast<unsigned int>(blob.size()), &blob,
+                status);
+}
+
+void CollectionStorage::writeObject(const std::string& collectionName, const std::string& primaryKey,
+                                    const std::string& sortKey, const unsigned char* blob, unsigned int blobSize,
+                                    const std::vector<unsigned char>* blobVector, ObjectStatus status) {
     objectStorage->saveObject(collectionName, primaryKey, sortKey, blob, blobSize, status);
     std::unordered_multimap<std::string, std::string> fields;
     CallbackManager::CollectionIndexerFunction indexer = callbackManager->getCollectionIndexerFunction();
     if (indexer) {
-        std::vector<unsigned char> blobCopy(blob, blob + blobSize);
-        fields = indexer(collectionName, primaryKey, sortKey, blobCopy);
+        // The indexer takes a vector; a caller that has one spares the copy.
+        std::vector<unsigned char> copy;
+        if (blobVector == nullptr) copy.assign(blob, blob + blobSize);
+        fields = indexer(collectionName, primaryKey, sortKey, blobVector != nullptr ? *blobVector : copy);
     }
     // Also without an indexer: the object's old index rows must go.
     indexStorage->saveObject(collectionName, primaryKey, fields);

@@ -96,6 +96,10 @@ public:
     virtual void saveObject(const std::string& collectionName, const std::string& primaryKey,
                             const std::string& sortKey, const unsigned char* blob, unsigned int blobSize,
                             ObjectStatus status);
+    // The same for a blob the caller holds as a vector, which the indexer is
+    // then given without a copy.
+    void saveObject(const std::string& collectionName, const std::string& primaryKey, const std::string& sortKey,
+                    const std::vector<unsigned char>& blob, ObjectStatus status);
 
     // Removes the object row and all the object's index rows.
     virtual void deleteObject(const std::string& collectionName, const std::string& primaryKey);
@@ -107,6 +111,11 @@ public:
     virtual uint64_t incrementAndGetVersionId(const std::string& collectionName);
 
 private:
+    // blobVector, when not null, holds the same bytes as blob.
+    void writeObject(const std::string& collectionName, const std::string& primaryKey, const std::string& sortKey,
+                     const unsigned char* blob, unsigned int blobSize, const std::vector<unsigned char>* blobVector,
+                     ObjectStatus status);
+
     std::shared_ptr<lumivale::sqlite::Database> database;
     std::shared_ptr<CallbackManager> callbackManager;
     std::shared_ptr<CollectionIndexStorage> indexStorage;

@@ -71,15 +71,18 @@ void DeltaHandler::writeLocalDelta(SyncProtocol::Delta delta, bool takeNextVersi
     // still be rolled back, and this thread may already hold the local write
     // lock.
     if (database->isInTransactionOnThisThread()) throw std::runtime_error(kWriteInsideTransaction);
+    const std::vector<CallbackManager::DeltaReceivedCallback> callbacks = callbackManager->getDeltaReceivedCallbacks();
+    std::vector<Delta> notice;
     {
         std::lock_guard<std::mutex> lock(localWriteMutex);
         if (takeNextVersionId) delta.versionId = collectionStorage->incrementAndGetVersionId(delta.collectionName);
         const int64_t queueId = queueAndApplyLocalDelta(delta);
+        if (!callbacks.empty()) notice.push_back(convertMQTTDeltaToApiDelta(delta, SyncProtocol::DeltaStatus::PENDING));
         // Still under the lock, so that changes wait to be sent in the order
         // of their version ids.
-        deltaQueue->addCommitted(queueId, delta);
+        deltaQueue->addCommitted(queueId, std::move(delta));
     }
-    callDeltaCallbacks({delta}, SyncProtocol::DeltaStatus::PENDING);
+    notify(callbacks, notice);
     deltaQueue->sendCommitted();
 }
 
@@ -195,8 +198,7 @@ void DeltaHandler::storeDeliveryMarks(const DeliveryMarks& marks) {
 void DeltaHandler::applyDelta(const SyncProtocol::Delta& delta, CollectionStorage::ObjectStatus status) {
     switch (delta.type) {
         case SyncProtocol::DeltaType::SAVE:
-            collectionStorage->saveObject(delta.collectionName, delta.primaryKey, delta.sortKey, delta.blob.data(),
-                                          static_cast<unsigned int>(delta.blob.size()), status);
+            collectionStorage->saveObject(delta.collectionName, delta.primaryKey, delta.sortKey, delta.blob, status);
             return;
         case SyncProtocol::DeltaType::DELETE:
             collectionStorage->deleteObject(delta.collectionName, delta.primaryKey);
@@ -224,12 +226,20 @@ CollectionStorage::ObjectStatus DeltaHandler::convToObjectStatus(DeltaQueue::Pen
 void DeltaHandler::callDeltaCallbacks(const std::vector<SyncProtocol::Delta>& deltas,
                                       SyncProtocol::DeltaStatus status) noexcept {
     if (deltas.empty()) return;
+    const std::vector<CallbackManager::DeltaReceivedCallback> callbacks = callbackManager->getDeltaReceivedCallbacks();
+    if (callbacks.empty()) return;
     std::vector<Delta> apiDeltas;
     apiDeltas.reserve(deltas.size());
     for (const SyncProtocol::Delta& delta : deltas) apiDeltas.push_back(convertMQTTDeltaToApiDelta(delta, status));
-    for (const auto& callback : callbackManager->getDeltaReceivedCallbacks()) {
+    notify(callbacks, apiDeltas);
+}
+
+void DeltaHandler::notify(const std::vector<CallbackManager::DeltaReceivedCallback>& callbacks,
+                          const std::vector<Delta>& deltas) noexcept {
+    if (deltas.empty()) return;
+    for (const auto& callback : callbacks) {
         try {
-            callback(apiDeltas);
+            callback(deltas);
         } catch (const std::exception& e) {
             lv_printLog(5, "tessarine", "Exception in delta callback: %s", e.what());
         }

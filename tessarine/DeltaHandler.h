@@ -34,6 +34,7 @@
 #include <utility>
 #include <vector>
 
+#include "tessarine/CallbackManager.h"
 #include "tessarine/CollectionStorage.h"
 #include "tessarine/Delta.h"
 #include "tessarine/DeltaQueue.h"
@@ -46,7 +47,6 @@ class Database;
 
 namespace tessarine {
 
-class CallbackManager;
 class Lifecycle;
 class SerializedJobQueue;
 class SubscriptionManager;
@@ -111,6 +111,10 @@ private:
     // id; localWriteMutex is held.
     int64_t queueAndApplyLocalDelta(const SyncProtocol::Delta& delta);
     void processDelivery(const std::vector<SyncProtocol::Delta>& deltas);
+    // Calls each callback with deltas (none for none); a callback's
+    // std::exception is logged and the next one still runs.
+    static void notify(const std::vector<CallbackManager::DeltaReceivedCallback>& callbacks,
+                       const std::vector<Delta>& deltas) noexcept;
     void processStatusUpdate(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     void postJob(std::function<void()> work);
 

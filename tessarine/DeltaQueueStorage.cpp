@@ -143,11 +143,13 @@ int64_t DeltaQueueStorage::insertDelta(const SyncProtocol::Delta& delta, SyncPro
     auto statement = database->prepare(
         "INSERT INTO " + getTableName() +
         " (collection_name, version_id, type, primary_key, sort_key, blob, status) VALUES (?, ?, ?, ?, ?, ?, ?)");
-    bindDeltaKey(statement, delta, 1);
+    // The delta outlives the one step that writes it.
+    statement.bindWithoutCopy(1, delta.collectionName);
+    statement.bind(2, static_cast<long long>(delta.versionId));
     statement.bind(3, static_cast<int>(delta.type));
-    statement.bind(4, delta.primaryKey);
-    statement.bind(5, delta.sortKey);
-    statement.bindBlob(6, delta.blob.data(), static_cast<unsigned int>(delta.blob.size()));
+    statement.bindWithoutCopy(4, delta.primaryKey);
+    statement.bindWithoutCopy(5, delta.sortKey);
+    statement.bindBlobWithoutCopy(6, delta.blob.data(), static_cast<unsigned int>(delta.blob.size()));
     statement.bind(7, static_cast<int>(status));
     statement.step();
     return database->lastInsertRowId();
