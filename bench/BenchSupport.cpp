@@ -4,6 +4,7 @@
 #include <sys/resource.h>
 #include <sys/wait.h>
 #include <unistd.h>
+#include <valgrind/callgrind.h>
 
 #include <algorithm>
 #include <chrono>
@@ -368,11 +369,14 @@ double processCpuSeconds() {
 }
 }  // namespace
 
-CpuMeter::CpuMeter() : start(processCpuSeconds()) {}
+// Under callgrind (scripts/bench.sh starts it with collection off) the
+// instructions of the measured loop are counted, from here to report().
+CpuMeter::CpuMeter() : start(processCpuSeconds()) { CALLGRIND_TOGGLE_COLLECT; }
 
 double CpuMeter::seconds() const { return processCpuSeconds() - start; }
 
 void report(benchmark::State& state, double opsPerIteration, const CpuMeter& cpu) {
+    CALLGRIND_TOGGLE_COLLECT;
     double iterations = static_cast<double>(std::max<benchmark::IterationCount>(state.iterations(), 1));
     state.counters["ops"] = opsPerIteration;
     state.counters["cpu_s"] = cpu.seconds() / iterations;
@@ -388,15 +392,22 @@ std::vector<std::function<void()>>& teardowns() {
 void atTeardown(std::function<void()> work) { teardowns().push_back(std::move(work)); }
 
 benchmark::internal::Benchmark* add(const std::string& name, std::function<void(benchmark::State&)> body) {
-    return benchmark::RegisterBenchmark(name.c_str(), [body](benchmark::State& state) {
-               try {
-                   body(state);
-               } catch (const std::exception& e) {
-                   state.SkipWithError(e.what());
-               }
-           })
-        ->UseRealTime()
-        ->Unit(benchmark::kMicrosecond);
+    auto* registered = benchmark::RegisterBenchmark(name.c_str(), [body](benchmark::State& state) {
+                           try {
+                               body(state);
+                           } catch (const std::exception& e) {
+                               state.SkipWithError(e.what());
+                           }
+                       })
+                           ->UseRealTime()
+                           ->Unit(benchmark::kMicrosecond);
+    // A count of instructions is only read right when the measured loop ran
+    // once, with a known number of iterations; benchmarks that fix their own
+    // count override this.
+    if (const char* iterations = std::getenv("TESSARINE_BENCH_ITERATIONS")) {
+        registered->Iterations(std::atoll(iterations));
+    }
+    return registered;
 }
 
 int runMain(int argc, char** argv) {

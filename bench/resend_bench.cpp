@@ -4,13 +4,15 @@
 // same transport. The queue is not changed by a resend, so every iteration
 // sends the whole queue again.
 //
-// resend/floor_read_first is the floor read the way the store's queue is
-// read by design: the whole queue into a vector first, then sent; it tells
-// the cost of that structure from the store's own overhead.
+// resend/floor_read_first is the floor reading the whole queue into a vector
+// first and then sending it, as the store once did; it shows what streaming
+// the queue in chunks saves.
 //
 // resend_memory/<side>/100000 resends a queue of 100 000 once and reports
 // how far that raised the process's peak resident memory (counter
 // "rss_growth_kib"); scripts/bench.sh runs each side in a process of its own.
+// resend_memory/ours/1000 does the same with 1 000 queued, so that the
+// growth that depends on the queue's length can be read off.
 #include <map>
 
 #include "BenchSupport.h"
@@ -20,6 +22,7 @@ namespace {
 
 constexpr uint64_t kQueued = 10000;
 constexpr uint64_t kQueuedForMemory = 100000;
+constexpr uint64_t kQueuedForSmallMemory = 1000;
 
 struct Environment {
     explicit Environment(uint64_t queued) : queued(queued) {}
@@ -136,16 +139,17 @@ void floorSide(benchmark::State& state, bool prepareEachUse, bool readWholeQueue
     report(state, 1, cpu);
 }
 
-void memory(benchmark::State& state, bool useStore, bool readWholeQueueFirst = false) {
-    Environment& env = environment(kQueuedForMemory);
+void memory(benchmark::State& state, bool useStore, bool readWholeQueueFirst = false,
+            uint64_t queued = kQueuedForMemory) {
+    Environment& env = environment(queued);
     FloorResend floor(env.floorDatabase, *env.ours->transport, false, readWholeQueueFirst);
     long before = peakRssKiB();
     const CpuMeter cpu;
     for (auto _ : state) {
         if (useStore) {
-            resendOurs(*env.ours, kQueuedForMemory);
+            resendOurs(*env.ours, queued);
         } else {
-            resendFloor(floor, *env.ours->transport, kQueuedForMemory);
+            resendFloor(floor, *env.ours->transport, queued);
         }
     }
     state.counters["rss_growth_kib"] = static_cast<double>(peakRssKiB() - before);
@@ -158,6 +162,8 @@ const bool registered = [] {
     add("resend/floor_prepare", [](benchmark::State& s) { floorSide(s, true); })->Iterations(20);
     add("resend/floor_read_first", [](benchmark::State& s) { floorSide(s, false, true); })->Iterations(20);
     add("resend_memory/ours/100000", [](benchmark::State& s) { memory(s, true); })->Iterations(1);
+    add("resend_memory/ours/1000", [](benchmark::State& s) { memory(s, true, false, kQueuedForSmallMemory); })
+        ->Iterations(1);
     add("resend_memory/floor/100000", [](benchmark::State& s) { memory(s, false); })->Iterations(1);
     add("resend_memory/floor_read_first/100000", [](benchmark::State& s) { memory(s, false, true); })
         ->Iterations(1);

@@ -47,9 +47,39 @@ run resend resend_bench --benchmark_filter='^resend/'
 run scale scale_bench
 # The memory of one resend of 100 000 queued deltas, each side in a process of
 # its own so that neither's peak hides the other's.
-run resend_memory_ours resend_bench --benchmark_filter='^resend_memory/ours/' --benchmark_repetitions=1
+run resend_memory_ours resend_bench --benchmark_filter='^resend_memory/ours/100000' --benchmark_repetitions=1
+run resend_memory_ours_small resend_bench --benchmark_filter='^resend_memory/ours/1000(/|$)' --benchmark_repetitions=1
 run resend_memory_floor resend_bench --benchmark_filter='^resend_memory/floor/' --benchmark_repetitions=1
 run resend_memory_floor_read_first resend_bench --benchmark_filter='^resend_memory/floor_read_first/' \
   --benchmark_repetitions=1
+
+# Instruction counts: each operation once more, alone, under callgrind, which
+# counts the instructions of the measured loop only (the programs switch
+# collection on and off around it on their own thread) and everything the
+# store's worker thread does (it runs jobs only for the measured operations).
+# Unlike times, these do not depend on what else the machine is doing.
+# BENCH_CALLGRIND=0 skips them.
+# count LABEL PROGRAM BENCHMARK: one benchmark, its JSON and callgrind's log.
+count() {
+  local label="$1" program="$2" benchmark="$3"
+  TESSARINE_BENCH_ITERATIONS="${BENCH_CALLGRIND_ITERATIONS:-200}" \
+    valgrind --tool=callgrind --collect-atstart=no --callgrind-out-file=/dev/null \
+    --toggle-collect='*SerializedJobQueue::retryUntilSucceeds*' \
+    "$build/bench/$program" --benchmark_filter="^$benchmark(/|\$)" --benchmark_repetitions=1 \
+    --benchmark_out="$results/callgrind/$label.json" --benchmark_out_format=json \
+    >/dev/null 2>"$results/callgrind/$label.log"
+}
+if [ "${BENCH_CALLGRIND:-1}" != 0 ]; then
+  mkdir -p "$results/callgrind"
+  for side in ours floor; do
+    echo "counting instructions, $side" >&2
+    count "local_save_$side" local_save_bench "local_save/$side"
+    count "remote_apply_$side" remote_apply_bench "remote_apply/$side"
+    for query in range_query get_object indexed_query indexed_sorted_query; do
+      count "${query}_$side" queries_bench "$query/$side"
+    done
+    count "resend_$side" resend_bench "resend/$side"
+  done
+fi
 
 python3 "$repo_root/scripts/bench_table.py" "$results"

@@ -1,5 +1,5 @@
 // Internal to the SQLite access layer: the one sqlite3 handle of a Database,
-// the recursive mutex that serialises every call on it, the depth of the
+// the recursive lock that serialises every call on it, the depth of the
 // transaction that the mutex's owner has open, and the cache of its idle
 // compiled statements.
 //
@@ -15,6 +15,7 @@
 #include <string>
 #include <thread>
 
+#include "sqlite/ConnectionMutex.h"
 #include "sqlite/StatementCache.h"
 
 struct sqlite3;
@@ -30,7 +31,7 @@ public:
     Connection& operator=(const Connection&) = delete;
 
     sqlite3* handle() const { return db; }
-    std::recursive_mutex& mutex() { return lock; }
+    ConnectionMutex& mutex() { return lock; }
 
     // Throws SQLiteException with the connection's current error message.
     [[noreturn]] void fail(int code, const std::string& context) const;
@@ -55,7 +56,7 @@ public:
 
 private:
     sqlite3* db = nullptr;
-    std::recursive_mutex lock;
+    ConnectionMutex lock;
     StatementCache cache;
 };
 

@@ -9,7 +9,7 @@ namespace lumivale {
 namespace sqlite {
 
 namespace {
-using Lock = std::lock_guard<std::recursive_mutex>;
+using Lock = std::lock_guard<ConnectionMutex>;
 }
 
 Statement::Statement(std::shared_ptr<Connection> connection, sqlite3_stmt* statement)
@@ -139,6 +139,17 @@ std::string Statement::Column::getText() const {
     const unsigned char* text = sqlite3_column_text(s, index);
     if (text == nullptr) return std::string();
     return std::string(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(s, index)));
+}
+
+void Statement::Column::copyTextTo(std::string& target) const {
+    sqlite3_stmt* s = statement.checkedHandle("reading a column");
+    Lock lock(statement.connection->mutex());
+    const unsigned char* text = sqlite3_column_text(s, index);
+    if (text == nullptr) {
+        target.clear();
+    } else {
+        target.assign(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(s, index)));
+    }
 }
 
 std::pair<const unsigned char*, std::size_t> Statement::Column::getBlobDirectBuffer() const {

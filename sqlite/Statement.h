@@ -35,6 +35,8 @@ public:
         int getInt() const;
         long long getInt64() const;
         std::string getText() const;  // empty for NULL; may hold zero bytes
+        // Copies the text into target, reusing its storage.
+        void copyTextTo(std::string& target) const;
         // The bytes in place, valid until the statement is stepped, reset or
         // destroyed. NULL and zero-length values give a count of 0.
         std::pair<const unsigned char*, std::size_t> getBlobDirectBuffer() const;

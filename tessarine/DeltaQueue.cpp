@@ -135,9 +135,7 @@ void DeltaQueue::processDeltaStatusUpdate(const SyncProtocol::Delta& delta, Sync
 void DeltaQueue::onConnectionEstablished() {
     if (stopped) return;
     try {
-        const int64_t upToId = sender.requestResend();
-        lv_printLog(3, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)",
-                    static_cast<unsigned>(deltaQueueStorage->countDeltasUpToId(upToId)));
+        sender.requestResend();
     } catch (const std::exception& e) {
         lv_printLog(6, "tessarine", "Error in DeltaQueue::onConnectionEstablished: %s", e.what());
     }

@@ -13,16 +13,21 @@ const char* const kSelectColumns =
     "SELECT  collection_name,  version_id,  type,  primary_key,  sort_key,  blob,  status FROM ";
 const char* const kWhereDelta = " WHERE  collection_name = ? AND   version_id = ?";
 
-// Reads the delta of the statement's current row (columns 0 to 5).
-SyncProtocol::Delta readDelta(lumivale::sqlite::Statement& statement) {
-    SyncProtocol::Delta delta;
-    delta.collectionName = statement(0).getText();
+// Reads the delta of the statement's current row (columns 0 to 5) into
+// delta, reusing the storage of its strings and blob.
+void readDeltaInto(lumivale::sqlite::Statement& statement, SyncProtocol::Delta& delta) {
+    statement(0).copyTextTo(delta.collectionName);
     delta.versionId = static_cast<uint64_t>(statement(1).getInt64());
     delta.type = static_cast<SyncProtocol::DeltaType>(statement(2).getInt());
-    delta.primaryKey = statement(3).getText();
-    delta.sortKey = statement(4).getText();
+    statement(3).copyTextTo(delta.primaryKey);
+    statement(4).copyTextTo(delta.sortKey);
     auto blob = statement(5).getBlobDirectBuffer();
     delta.blob.assign(blob.first, blob.first + blob.second);
+}
+
+SyncProtocol::Delta readDelta(lumivale::sqlite::Statement& statement) {
+    SyncProtocol::Delta delta;
+    readDeltaInto(statement, delta);
     return delta;
 }
 
@@ -105,8 +110,8 @@ std::optional<SyncProtocol::DeltaStatus> DeltaQueueStorage::getDeltaStatus(const
     return static_cast<SyncProtocol::DeltaStatus>(statement(0).getInt());
 }
 
-std::vector<DeltaQueueStorage::QueuedDelta> DeltaQueueStorage::getDeltasInIdRange(int64_t afterId, int64_t upToId,
-                                                                                 int limit) {
+void DeltaQueueStorage::readDeltasInIdRange(int64_t afterId, int64_t upToId, int limit,
+                                            std::vector<QueuedDelta>& rows) {
     lumivale::sqlite::Database::ScopedLock lock(*database);
     auto statement = database->prepare(std::string("SELECT  collection_name,  version_id,  type,  primary_key,  "
                                                    "sort_key,  blob,  id FROM ") +
@@ -114,21 +119,14 @@ std::vector<DeltaQueueStorage::QueuedDelta> DeltaQueueStorage::getDeltasInIdRang
     statement.bind(1, static_cast<long long>(afterId));
     statement.bind(2, static_cast<long long>(upToId));
     statement.bind(3, limit);
-    std::vector<QueuedDelta> result;
+    size_t count = 0;
     while (statement.step()) {
-        QueuedDelta queued;
-        queued.delta = readDelta(statement);
+        if (count == rows.size()) rows.emplace_back();
+        QueuedDelta& queued = rows[count++];
+        readDeltaInto(statement, queued.delta);
         queued.id = statement(6).getInt64();
-        result.push_back(std::move(queued));
     }
-    return result;
-}
-
-int64_t DeltaQueueStorage::countDeltasUpToId(int64_t upToId) {
-    auto statement = database->prepare("SELECT COUNT(*) FROM " + getTableName() + " WHERE id <= ?");
-    statement.bind(1, static_cast<long long>(upToId));
-    statement.step();
-    return statement(0).getInt64();
+    rows.resize(count);
 }
 
 int64_t DeltaQueueStorage::getLastId() {

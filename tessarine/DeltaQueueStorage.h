@@ -57,10 +57,11 @@ public:
     virtual std::vector<SyncProtocol::Delta> getDeltaRangeByVersionId(const std::string& collectionName,
                                                                       uint64_t lowestVersionId,
                                                                       uint64_t highestVersionId);
-    // Up to limit queued deltas with afterId < id <= upToId, oldest first.
-    virtual std::vector<QueuedDelta> getDeltasInIdRange(int64_t afterId, int64_t upToId, int limit);
-    // How many deltas are queued with id <= upToId.
-    virtual int64_t countDeltasUpToId(int64_t upToId);
+    // Up to limit queued deltas with afterId < id <= upToId, oldest first,
+    // into rows (resized to their count). The rows' strings and blobs are
+    // overwritten in place, so reading chunk after chunk into the same
+    // vector allocates next to nothing.
+    virtual void readDeltasInIdRange(int64_t afterId, int64_t upToId, int limit, std::vector<QueuedDelta>& rows);
     // The highest id the queue has ever given a row; 0 for a new queue.
     virtual int64_t getLastId();
     // Returns the new row's id.

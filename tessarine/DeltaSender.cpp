@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <exception>
+#include <optional>
 #include <utility>
 #include <vector>
 
@@ -51,7 +52,7 @@ void DeltaSender::addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexc
     }
 }
 
-int64_t DeltaSender::requestResend() {
+void DeltaSender::requestResend() {
     // Read outside the lock: the queue may hold rows that were committed
     // before this sender was made, and a change committed after this read
     // has a greater id, so it is added as live and sent after the resend.
@@ -69,9 +70,9 @@ int64_t DeltaSender::requestResend() {
     resend.active = true;
     resend.upToId = std::max(storedUpToId, lastCommittedId);
     resend.sentUpToId = 0;
+    resend.sentCount = 0;
     suspended = false;
     live.clear();
-    return resend.upToId;
 }
 
 void DeltaSender::sendWaiting() noexcept {
@@ -100,11 +101,11 @@ DeltaSender::Next DeltaSender::takeNext(Chunk& chunk) {
             next.kind = Next::Kind::READ_CHUNK;
         } else {
             next.kind = Next::Kind::RESEND;
-            next.queued = std::move(chunk.rows[chunk.next++]);
+            next.resent = &chunk.rows[chunk.next++];
         }
     } else if (!live.empty()) {
         next.kind = Next::Kind::LIVE;
-        next.queued = std::move(live.front());
+        next.live = std::move(live.front().delta);
         live.pop_front();
     } else {
         sending = false;
@@ -121,31 +122,38 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
         afterId = resend.sentUpToId;
         upToId = resend.upToId;
     }
-    std::vector<DeltaQueueStorage::QueuedDelta> rows;
+    // Read into the chunk itself: its strings and blobs are reused.
+    chunk.generation = 0;
     bool failed = false;
     try {
-        rows = deltaQueueStorage->getDeltasInIdRange(afterId, upToId, kResendChunkSize);
-        for (auto& row : rows) row.delta.clientId = clientId;
+        deltaQueueStorage->readDeltasInIdRange(afterId, upToId, kResendChunkSize, chunk.rows);
+        for (auto& row : chunk.rows) row.delta.clientId = clientId;
     } catch (const std::exception& e) {
         lv_printLog(6, "tessarine", kResendError, e.what());
         failed = true;
     }
-    std::lock_guard<std::mutex> lock(mutex);
-    if (resend.generation != generation) return;  // a newer resend starts over
-    if (failed) {
-        suspend();
-    } else if (rows.empty()) {
-        resend.active = false;
-    } else {
-        chunk.rows = std::move(rows);
-        chunk.next = 0;
-        chunk.generation = generation;
+    std::optional<unsigned> completedCount;
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        if (resend.generation != generation) return;  // a newer resend starts over
+        if (failed) {
+            suspend();
+        } else if (chunk.rows.empty()) {
+            resend.active = false;
+            completedCount = resend.sentCount;
+        } else {
+            chunk.next = 0;
+            chunk.generation = generation;
+        }
+    }
+    if (completedCount) {
+        lv_printLog(3, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)", *completedCount);
     }
 }
 
 void DeltaSender::send(const Next& next) {
     const bool resent = next.kind == Next::Kind::RESEND;
-    const bool taken = hand(*syncProtocol, next.queued.delta, resent);
+    const bool taken = hand(*syncProtocol, resent ? next.resent->delta : next.live, resent);
     std::lock_guard<std::mutex> lock(mutex);
     // After a newer request, what this send did no longer matters: the new
     // resend carries everything from the start.
@@ -153,7 +161,8 @@ void DeltaSender::send(const Next& next) {
     if (!taken) {
         suspend();
     } else if (resent) {
-        resend.sentUpToId = next.queued.id;
+        resend.sentUpToId = next.resent->id;
+        ++resend.sentCount;
     }
 }
 

@@ -57,17 +57,19 @@ public:
 
     // A new connection: every change committed so far goes out again, oldest
     // first, before anything committed later; a resend under way starts
-    // over. Sending resumes if a failure had stopped it. Returns the highest
-    // queue id the resend covers. Throws what reading the queue throws; then
-    // nothing is handed over until the next request.
-    int64_t requestResend();
+    // over. Sending resumes if a failure had stopped it. A resend that
+    // completes logs how many deltas it handed over (priority 3). Throws what
+    // reading the queue throws; then nothing is handed over until the next
+    // request.
+    void requestResend();
 
     // Hands over what waits, on the calling thread, unless somebody is
     // already doing so. Never throws.
     void sendWaiting() noexcept;
 
 private:
-    // What a resend has read and not sent yet; the sending thread's own.
+    // What a resend has read and not sent yet; the sending thread's own,
+    // reused from chunk to chunk.
     struct Chunk {
         std::vector<DeltaQueueStorage::QueuedDelta> rows;
         size_t next = 0;
@@ -81,12 +83,15 @@ private:
         uint64_t generation = 0;  // counts requests; a newer one restarts
         int64_t upToId = 0;       // the last id committed when requested
         int64_t sentUpToId = 0;   // how far it has got
+        unsigned sentCount = 0;
     };
-    // One step of the sending thread, taken under mutex.
+    // One step of the sending thread, taken under mutex: a resent delta is
+    // sent from the chunk in place, a live one taken out of the queue.
     struct Next {
         enum class Kind { NOTHING, READ_CHUNK, RESEND, LIVE } kind = Kind::NOTHING;
         uint64_t generation = 0;
-        DeltaQueueStorage::QueuedDelta queued;
+        const DeltaQueueStorage::QueuedDelta* resent = nullptr;
+        SyncProtocol::Delta live;
     };
 
     // Chooses the next step; mutex is held. Clears sending when there is
