@@ -105,6 +105,17 @@ std::optional<SyncProtocol::DeltaStatus> DeltaQueueStorage::getDeltaStatus(const
     return static_cast<SyncProtocol::DeltaStatus>(statement(0).getInt());
 }
 
+std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> DeltaQueueStorage::countDeltasByStatus() {
+    lumivale::sqlite::Database::ScopedLock lock(*database);
+    auto statement = database->prepare("SELECT status, COUNT(*) FROM " + getTableName() + " GROUP BY status");
+    std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> result;
+    while (statement.step()) {
+        result.emplace_back(static_cast<SyncProtocol::DeltaStatus>(statement(0).getInt()),
+                            static_cast<uint64_t>(statement(1).getInt64()));
+    }
+    return result;
+}
+
 void DeltaQueueStorage::insertDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
     auto statement = database->prepare(
         "INSERT INTO " + getTableName() +

@@ -49,6 +49,9 @@ public:
     virtual std::vector<SyncProtocol::Delta> getDeltaRangeByVersionId(const std::string& collectionName,
                                                                       uint64_t lowestVersionId,
                                                                       uint64_t highestVersionId);
+    // How many deltas are queued with each status; statuses without a row
+    // are left out.
+    virtual std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> countDeltasByStatus();
     virtual void insertDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     // Asserts on PERSISTED: persisted deltas are removed, never stored.
     virtual void updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
