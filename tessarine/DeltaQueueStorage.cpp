@@ -42,6 +42,14 @@ std::vector<std::string> dbqueries::CreateDeltaQueueTable::getIndexSqls(const st
     };
 }
 
+std::string dbqueries::SelectAllDeltas::getSql(const std::string& tableName) {
+    return kSelectColumns + tableName + " ORDER BY id ASC";
+}
+
+std::string dbqueries::CountDeltasByStatus::getSql(const std::string& tableName) {
+    return "SELECT status, COUNT(*) FROM " + tableName + " GROUP BY status";
+}
+
 DeltaQueueStorage::DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> database)
     : database(std::move(database)) {
     createDbTableIfNecessary();
@@ -49,7 +57,7 @@ DeltaQueueStorage::DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database>
 
 DeltaQueueStorage::~DeltaQueueStorage() = default;
 
-std::string DeltaQueueStorage::getTableName() const { return "delta_queue"; }
+std::string DeltaQueueStorage::getTableName() const { return TABLE_NAME; }
 
 void DeltaQueueStorage::createDbTableIfNecessary() {
     const std::string table = getTableName();
@@ -65,7 +73,7 @@ std::vector<std::pair<SyncProtocol::Delta, SyncProtocol::DeltaStatus>> DeltaQueu
     // A resend reads the whole queue outside any transaction: one lock for
     // the read instead of eight per row.
     lumivale::sqlite::Database::ScopedLock lock(*database);
-    auto statement = database->prepare(kSelectColumns + getTableName() + " ORDER BY id ASC");
+    auto statement = database->prepare(dbqueries::SelectAllDeltas::getSql(getTableName()));
     std::vector<std::pair<SyncProtocol::Delta, SyncProtocol::DeltaStatus>> result;
     while (statement.step()) {
         result.emplace_back(readDelta(statement), static_cast<SyncProtocol::DeltaStatus>(statement(6).getInt()));
@@ -107,7 +115,7 @@ std::optional<SyncProtocol::DeltaStatus> DeltaQueueStorage::getDeltaStatus(const
 
 std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> DeltaQueueStorage::countDeltasByStatus() {
     lumivale::sqlite::Database::ScopedLock lock(*database);
-    auto statement = database->prepare("SELECT status, COUNT(*) FROM " + getTableName() + " GROUP BY status");
+    auto statement = database->prepare(dbqueries::CountDeltasByStatus::getSql(getTableName()));
     std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> result;
     while (statement.step()) {
         result.emplace_back(static_cast<SyncProtocol::DeltaStatus>(statement(0).getInt()),

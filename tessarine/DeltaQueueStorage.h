@@ -30,10 +30,21 @@ namespace dbqueries {
 struct CreateDeltaQueueTable {
     static std::vector<std::string> getIndexSqls(const std::string& tableName);
 };
+// Every queued delta in resend order, columns collection_name, version_id,
+// type, primary_key, sort_key, blob, status.
+struct SelectAllDeltas {
+    static std::string getSql(const std::string& tableName);
+};
+// Columns status and the number of queued deltas with it.
+struct CountDeltasByStatus {
+    static std::string getSql(const std::string& tableName);
+};
 }  // namespace dbqueries
 
 class DeltaQueueStorage {
 public:
+    static inline const std::string TABLE_NAME = "delta_queue";
+
     // Creates the table and its two indexes if they are missing.
     explicit DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> database);
     virtual ~DeltaQueueStorage();
