@@ -39,6 +39,9 @@ std::vector<std::string> dbqueries::CreateDeltaQueueTable::getIndexSqls(const st
             " (collection_name, primary_key)",
         "CREATE INDEX IF NOT EXISTS " + quoted(tableName + "_coll_id_ver_id_idx") + " ON " + quoted(tableName) +
             " (collection_name, version_id)",
+        // Lets the sync metrics count the queue by status from the index
+        // alone, without reading the rows and their blobs.
+        "CREATE INDEX IF NOT EXISTS " + quoted(tableName + "_status_idx") + " ON " + quoted(tableName) + " (status)",
     };
 }
 

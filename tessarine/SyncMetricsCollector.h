@@ -3,9 +3,9 @@
 // the outgoing queue's counts by status and the worker's state.
 //
 // The queue counts are read from the "delta_queue" table (one GROUP BY
-// statement) rather than kept as counters in memory: the table is the only
-// record that stays exact across rolled-back transactions, restarts and
-// snapshots, and a queue that the server keeps up with is short. Reading
+// statement, answered from the queue's status index) rather than kept as
+// counters in memory: the table is the only record that stays exact across
+// rolled-back transactions, restarts and snapshots. Reading
 // takes the database's lock for that one statement, so it may wait for a
 // transaction in progress; everything else is atomic or behind the job
 // queue's own short locks.
