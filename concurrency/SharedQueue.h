@@ -80,6 +80,7 @@ public:
     }
 
     bool isNotEmptyNoLock() const { return !items.empty(); }
+    // The number of queued items (not their cost).
     std::size_t sizeNoLock() const { return items.size(); }
 
     // The front item; the queue must not be empty. The reference is valid

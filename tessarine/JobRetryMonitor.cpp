@@ -39,7 +39,7 @@ void JobRetryMonitor::jobEnded(bool succeeded) {
     {
         std::lock_guard<std::mutex> lock(mutex);
         reportRecovery = succeeded && stallReported;
-        failedFor = millisecondsSince(failingSinceSteady);
+        if (reportRecovery) failedFor = millisecondsSince(failingSinceSteady);
         current = State();
         stallReported = false;
     }
