@@ -8,6 +8,10 @@
 // first and then sending it, as the store once did; it shows what streaming
 // the queue in chunks saves.
 //
+// sync_metrics/<side> reads Tessarine::getSyncMetrics with the same 10 000
+// deltas queued, against the count by status on raw SQLite (the rest of the
+// metrics is memory only).
+//
 // resend_memory/<side>/100000 resends a queue of 100 000 once and reports
 // how far that raised the process's peak resident memory (counter
 // "rss_growth_kib"); scripts/bench.sh runs each side in a process of its own.
@@ -139,6 +143,31 @@ void floorSide(benchmark::State& state, bool prepareEachUse, bool readWholeQueue
     report(state, 1, cpu);
 }
 
+void metricsOurs(benchmark::State& state) {
+    Environment& env = environment(kQueued);
+    const CpuMeter cpu;
+    for (auto _ : state) {
+        auto metrics = env.ours->store->getSyncMetrics();
+        if (!metrics || metrics->queuedChanges() != kQueued) throw std::runtime_error("wrong queue count");
+    }
+    report(state, 1, cpu);
+}
+
+void metricsFloor(benchmark::State& state, bool prepareEachUse) {
+    Environment& env = environment(kQueued);
+    RawStatement count(prepareEachUse ? env.floorPrepareDatabase : env.floorDatabase,
+                       "SELECT status, COUNT(*) FROM delta_queue GROUP BY status", prepareEachUse);
+    const CpuMeter cpu;
+    for (auto _ : state) {
+        uint64_t queued = 0;
+        count.start();
+        while (count.step()) queued += static_cast<uint64_t>(count.columnInt64(1));
+        count.done();
+        if (queued != kQueued) throw std::runtime_error("wrong queue count");
+    }
+    report(state, 1, cpu);
+}
+
 void memory(benchmark::State& state, bool useStore, bool readWholeQueueFirst = false,
             uint64_t queued = kQueuedForMemory) {
     Environment& env = environment(queued);
@@ -161,6 +190,9 @@ const bool registered = [] {
     add("resend/floor", [](benchmark::State& s) { floorSide(s, false); })->Iterations(20);
     add("resend/floor_prepare", [](benchmark::State& s) { floorSide(s, true); })->Iterations(20);
     add("resend/floor_read_first", [](benchmark::State& s) { floorSide(s, false, true); })->Iterations(20);
+    add("sync_metrics/ours", metricsOurs);
+    add("sync_metrics/floor", [](benchmark::State& s) { metricsFloor(s, false); });
+    add("sync_metrics/floor_prepare", [](benchmark::State& s) { metricsFloor(s, true); });
     add("resend_memory/ours/100000", [](benchmark::State& s) { memory(s, true); })->Iterations(1);
     add("resend_memory/ours/1000", [](benchmark::State& s) { memory(s, true, false, kQueuedForSmallMemory); })
         ->Iterations(1);

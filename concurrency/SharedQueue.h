@@ -23,6 +23,7 @@
 #include <chrono>
 #include <climits>
 #include <condition_variable>
+#include <cstddef>
 #include <deque>
 #include <mutex>
 #include <stdexcept>
@@ -79,6 +80,8 @@ public:
     }
 
     bool isNotEmptyNoLock() const { return !items.empty(); }
+    // The number of queued items (not their cost).
+    std::size_t sizeNoLock() const { return items.size(); }
 
     // The front item; the queue must not be empty. The reference is valid
     // only while the mutex stays locked.

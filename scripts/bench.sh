@@ -44,6 +44,7 @@ run local_save local_save_bench
 run remote_apply remote_apply_bench
 run queries queries_bench
 run resend resend_bench --benchmark_filter='^resend/'
+run sync_metrics resend_bench --benchmark_filter='^sync_metrics/'
 run scale scale_bench
 # The memory of one resend of 100 000 queued deltas, each side in a process of
 # its own so that neither's peak hides the other's.

@@ -23,6 +23,7 @@ LABELS = {
     "indexed_query": "indexed query, ~100 rows (per row)",
     "indexed_sorted_query": "indexed sorted query, ~100 rows (per row)",
     "resend": "resend of 10 000 queued deltas (whole)",
+    "sync_metrics": "sync metrics with 10 000 queued deltas (whole)",
     "scale_save": "save at {size} objects (per save)",
     "scale_range_query": "range query at {size} objects (per row)",
 }

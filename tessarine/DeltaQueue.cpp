@@ -86,6 +86,7 @@ int DeltaQueue::updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol
     if (!current || *current == status) return QUEUE_UNCHANGED;
     if (status == SyncProtocol::DeltaStatus::PERSISTED) {
         deltaQueueStorage->removeDelta(delta);
+        if (changePersistedListener) changePersistedListener();
     } else {
         deltaQueueStorage->updateDeltaStatus(delta, status);
     }
@@ -94,6 +95,10 @@ int DeltaQueue::updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol
 
 void DeltaQueue::addDeltaStatusUpdatedCallback(const DeltaStatusUpdatedCallback& callback) {
     deltaStatusUpdatedCallbacks.push_back(callback);
+}
+
+void DeltaQueue::setChangePersistedListener(std::function<void()> listener) {
+    changePersistedListener = std::move(listener);
 }
 
 void DeltaQueue::onDeltaStatusUpdated(const SyncProtocol::DeltaStatusUpdate& update) {

@@ -77,6 +77,10 @@ public:
     // the stored one. Calls no listener.
     virtual int updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     virtual void addDeltaStatusUpdatedCallback(const DeltaStatusUpdatedCallback& callback);
+    // Called whenever a row leaves the queue as PERSISTED, inside the
+    // transaction that removes it (the metrics take its time from it). Set
+    // while the store is built, like the listeners; it must not throw.
+    void setChangePersistedListener(std::function<void()> listener);
 
     // The least advanced status; empty for no statuses.
     std::optional<SyncProtocol::DeltaStatus> getMinStatus(const std::vector<SyncProtocol::DeltaStatus>& statuses);
@@ -95,6 +99,7 @@ private:
     std::shared_ptr<SyncProtocol> syncProtocol;
     DeltaSender sender;
     std::vector<DeltaStatusUpdatedCallback> deltaStatusUpdatedCallbacks;
+    std::function<void()> changePersistedListener;
     int connectionEstablishedCallbackId = 0;
     int deltaStatusUpdatedCallbackId = 0;
     int lifecycleStopCallbackId = 0;

@@ -44,7 +44,18 @@ std::vector<std::string> dbqueries::CreateDeltaQueueTable::getIndexSqls(const st
             " (collection_name, primary_key)",
         "CREATE INDEX IF NOT EXISTS " + quoted(tableName + "_coll_id_ver_id_idx") + " ON " + quoted(tableName) +
             " (collection_name, version_id)",
+        // Lets the sync metrics count the queue by status from the index
+        // alone, without reading the rows and their blobs.
+        "CREATE INDEX IF NOT EXISTS " + quoted(tableName + "_status_idx") + " ON " + quoted(tableName) + " (status)",
     };
+}
+
+std::string dbqueries::SelectAllDeltas::getSql(const std::string& tableName) {
+    return kSelectColumns + tableName + " ORDER BY id ASC";
+}
+
+std::string dbqueries::CountDeltasByStatus::getSql(const std::string& tableName) {
+    return "SELECT status, COUNT(*) FROM " + tableName + " GROUP BY status";
 }
 
 DeltaQueueStorage::DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> database)
@@ -54,7 +65,7 @@ DeltaQueueStorage::DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database>
 
 DeltaQueueStorage::~DeltaQueueStorage() = default;
 
-std::string DeltaQueueStorage::getTableName() const { return "delta_queue"; }
+std::string DeltaQueueStorage::getTableName() const { return TABLE_NAME; }
 
 void DeltaQueueStorage::createDbTableIfNecessary() {
     const std::string table = getTableName();
@@ -70,7 +81,7 @@ std::vector<std::pair<SyncProtocol::Delta, SyncProtocol::DeltaStatus>> DeltaQueu
     // A resend reads the whole queue outside any transaction: one lock for
     // the read instead of eight per row.
     lumivale::sqlite::Database::ScopedLock lock(*database);
-    auto statement = database->prepare(kSelectColumns + getTableName() + " ORDER BY id ASC");
+    auto statement = database->prepare(dbqueries::SelectAllDeltas::getSql(getTableName()));
     std::vector<std::pair<SyncProtocol::Delta, SyncProtocol::DeltaStatus>> result;
     while (statement.step()) {
         result.emplace_back(readDelta(statement), static_cast<SyncProtocol::DeltaStatus>(statement(6).getInt()));
@@ -135,6 +146,17 @@ int64_t DeltaQueueStorage::getLastId() {
     auto statement = database->prepare("SELECT seq FROM sqlite_sequence WHERE name = ?");
     statement.bind(1, getTableName());
     return statement.step() ? statement(0).getInt64() : 0;
+}
+
+std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> DeltaQueueStorage::countDeltasByStatus() {
+    lumivale::sqlite::Database::ScopedLock lock(*database);
+    auto statement = database->prepare(dbqueries::CountDeltasByStatus::getSql(getTableName()));
+    std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> result;
+    while (statement.step()) {
+        result.emplace_back(static_cast<SyncProtocol::DeltaStatus>(statement(0).getInt()),
+                            static_cast<uint64_t>(statement(1).getInt64()));
+    }
+    return result;
 }
 
 int64_t DeltaQueueStorage::insertDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {

@@ -31,10 +31,21 @@ namespace dbqueries {
 struct CreateDeltaQueueTable {
     static std::vector<std::string> getIndexSqls(const std::string& tableName);
 };
+// Every queued delta in resend order, columns collection_name, version_id,
+// type, primary_key, sort_key, blob, status.
+struct SelectAllDeltas {
+    static std::string getSql(const std::string& tableName);
+};
+// Columns status and the number of queued deltas with it.
+struct CountDeltasByStatus {
+    static std::string getSql(const std::string& tableName);
+};
 }  // namespace dbqueries
 
 class DeltaQueueStorage {
 public:
+    static inline const std::string TABLE_NAME = "delta_queue";
+
     // A queued delta with its row id, which orders the queue: ids only grow
     // and are never reused, so a later insert always has a greater id.
     struct QueuedDelta {
@@ -57,6 +68,10 @@ public:
     virtual std::vector<SyncProtocol::Delta> getDeltaRangeByVersionId(const std::string& collectionName,
                                                                       uint64_t lowestVersionId,
                                                                       uint64_t highestVersionId);
+    // How many deltas are queued with each status; statuses without a row
+    // are left out.
+    virtual std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> countDeltasByStatus();
+
     // Up to limit queued deltas with afterId < id <= upToId, oldest first,
     // into rows (resized to their count). The rows' strings and blobs are
     // overwritten in place, so reading chunk after chunk into the same

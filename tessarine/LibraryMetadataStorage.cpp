@@ -7,7 +7,7 @@ namespace lumivale {
 namespace tessarine {
 
 namespace {
-const std::string kTable = "library_metadata";
+const std::string& kTable = LibraryMetadataStorage::TABLE_NAME;
 }
 
 LibraryMetadataStorage::KeyNotFoundError::KeyNotFoundError(const std::string& key)

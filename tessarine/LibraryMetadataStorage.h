@@ -19,6 +19,8 @@ namespace tessarine {
 
 class LibraryMetadataStorage {
 public:
+    static inline const std::string TABLE_NAME = "library_metadata";
+
     // what() is: Key not found: "<key>"
     class KeyNotFoundError : public std::runtime_error {
     public:

@@ -1,6 +1,8 @@
 #include "tessarine/SerializedJobQueue.h"
 
 #include <exception>
+#include <optional>
+#include <string>
 #include <stdexcept>
 #include <utility>
 
@@ -19,8 +21,9 @@ constexpr std::chrono::milliseconds kIdleWait(4294967295LL);
 }  // namespace
 
 SerializedJobQueue::SerializedJobQueue(std::shared_ptr<ThreadCreator> threadCreator,
-                                       ExponentialBackoff<std::chrono::milliseconds> backoff)
-    : jobs(-1), threadCreator(std::move(threadCreator)), backoff(backoff) {
+                                       ExponentialBackoff<std::chrono::milliseconds> backoff,
+                                       std::chrono::milliseconds stallThreshold)
+    : jobs(-1), threadCreator(std::move(threadCreator)), backoff(backoff), retryMonitor(stallThreshold) {
     if (!this->threadCreator) throw std::runtime_error("SerializedJobQueue needs a ThreadCreator");
     if (!this->backoff.isValid()) throw std::runtime_error("SerializedJobQueue: invalid back-off");
     std::thread thread = this->threadCreator->createThread([this] { mainLoop(); });
@@ -57,6 +60,13 @@ void SerializedJobQueue::addJob(Job job) {
     jobs.queue(job, false);
 }
 
+std::size_t SerializedJobQueue::getWaitingJobCount() {
+    auto lock = jobs.lock();
+    return jobs.sizeNoLock();
+}
+
+JobRetryMonitor::State SerializedJobQueue::getRetryState() const { return retryMonitor.state(); }
+
 void SerializedJobQueue::mainLoop() {
     while (running) {
         {
@@ -85,24 +95,33 @@ void SerializedJobQueue::consumeQueue() {
 void SerializedJobQueue::retryUntilSucceeds(const Job& job) {
     backoff.reset();
     while (true) {
+        std::optional<std::string> failure;
         {
             std::lock_guard<std::mutex> jobLock(jobMutex);
-            if (!running) return;  // the job is abandoned
-            if (attempt(job)) return;
+            if (!running) break;  // the job is abandoned
+            failure = attempt(job);
         }
+        // Reported outside jobMutex: the monitor may log, and the log may be
+        // routed to the application.
+        if (!failure) {
+            retryMonitor.jobEnded(true);
+            return;
+        }
+        retryMonitor.attemptFailed(*failure);
         interruptableSleep(backoff.nextPause());
     }
+    retryMonitor.jobEnded(false);
 }
 
-bool SerializedJobQueue::attempt(const Job& job) {
+std::optional<std::string> SerializedJobQueue::attempt(const Job& job) {
     try {
         job.run();
-        return true;
-    } catch (const std::exception&) {
-        return false;  // the job has logged what went wrong
+        return std::nullopt;
+    } catch (const std::exception& e) {
+        return std::string(e.what());  // the job has logged what went wrong
     } catch (...) {
         lv_printLog(6, "tessarine", "Job failed with an exception not derived from std::exception; retrying");
-        return false;
+        return std::string("an exception not derived from std::exception");
     }
 }
 

@@ -14,7 +14,7 @@ SubscriptionStorage::SubscriptionStorage(std::shared_ptr<lumivale::sqlite::Datab
 
 SubscriptionStorage::~SubscriptionStorage() = default;
 
-std::string SubscriptionStorage::getTableName() const { return "subscriptions"; }
+std::string SubscriptionStorage::getTableName() const { return TABLE_NAME; }
 
 void SubscriptionStorage::createDbTableIfNecessary() {
     database->exec("CREATE TABLE IF NOT EXISTS " + getTableName() +

@@ -26,6 +26,8 @@ struct Subscription {
 
 class SubscriptionStorage {
 public:
+    static inline const std::string TABLE_NAME = "subscriptions";
+
     // Creates the table if it is missing.
     explicit SubscriptionStorage(std::shared_ptr<lumivale::sqlite::Database> database);
     virtual ~SubscriptionStorage();

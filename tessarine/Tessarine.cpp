@@ -21,6 +21,7 @@
 #include "tessarine/SnapshotGenerator.h"
 #include "tessarine/SubscriptionManager.h"
 #include "tessarine/SubscriptionStorage.h"
+#include "tessarine/SyncMetricsCollector.h"
 #include "tessarine/VersionIdGenerator.h"
 #include "tessarine/VersionVectorStorage.h"
 
@@ -97,6 +98,10 @@ Tessarine::Tessarine(std::shared_ptr<SyncProtocol> syncProtocol, std::shared_ptr
     snapshotGenerator = std::make_shared<SnapshotGenerator>(this->database, collectionStorage, subscriptionManager,
                                                             this->versionVectorStorage);
     snapshotConsumer = std::make_shared<SnapshotConsumer>(deltaQueueStorage, this->syncProtocol, subscriptionManager);
+    syncMetrics = std::make_shared<SyncMetricsCollector>(this->syncProtocol, deltaQueueStorage, jobQueue);
+    // Shared, not borrowed: collection handles can keep the delta queue, and
+    // with it the worker, alive after this instance is gone.
+    deltaQueue->setChangePersistedListener([metrics = syncMetrics] { metrics->onChangePersisted(); });
 }
 
 Tessarine::~Tessarine() = default;
@@ -119,6 +124,15 @@ std::unique_ptr<Collection> Tessarine::subscribeCollection(const std::string& co
     } catch (const std::exception& e) {
         lv_printLog(6, "tessarine", "Error while subscribing to collection %s: %s", collectionName.c_str(), e.what());
         return nullptr;
+    }
+}
+
+std::optional<SyncMetrics> Tessarine::getSyncMetrics() const noexcept {
+    try {
+        return syncMetrics->read();
+    } catch (const std::exception& e) {
+        lv_printLog(6, "tessarine", "Error while reading sync metrics: %s", e.what());
+        return std::nullopt;
     }
 }
 

@@ -25,10 +25,12 @@
 #pragma once
 
 #include <memory>
+#include <optional>
 #include <string>
 
 #include "tessarine/CallbackManager.h"
 #include "tessarine/Collection.h"
+#include "tessarine/SyncMetrics.h"
 #include "tessarine/SyncProtocol.h"
 #include "tessarine/ThreadCreator.h"
 
@@ -47,6 +49,7 @@ class SnapshotConsumer;
 class SnapshotGenerator;
 class SubscriptionManager;
 class SubscriptionStorage;
+class SyncMetricsCollector;
 class VersionIdGenerator;
 class VersionVectorStorage;
 
@@ -85,6 +88,15 @@ public:
     // failure. Every call makes a new handle on the same tables.
     std::unique_ptr<Collection> subscribeCollection(const std::string& collectionName) noexcept;
 
+    // How far synchronisation has got: queued changes by status, jobs
+    // waiting on the worker, whether it is retrying a failed job (since when,
+    // why), connections seen and when a change was last persisted. Cheap
+    // (one short query on the queue table, which may wait for a transaction
+    // in progress) and callable from any thread, the worker and transport
+    // callbacks included. Empty, after logging "Error while reading sync
+    // metrics: <reason>" at priority 6, when the queue cannot be read.
+    std::optional<SyncMetrics> getSyncMetrics() const noexcept;
+
     // Register before start(); registering later is safe too.
     void addDeltaReceivedCallback(const CallbackManager::DeltaReceivedCallback& callback) noexcept;
     void setCollectionIndexerFunction(const CallbackManager::CollectionIndexerFunction& indexer) noexcept;
@@ -122,6 +134,7 @@ private:
     std::shared_ptr<Lifecycle> lifecycle;
     std::shared_ptr<SnapshotGenerator> snapshotGenerator;
     std::shared_ptr<SnapshotConsumer> snapshotConsumer;
+    std::shared_ptr<SyncMetricsCollector> syncMetrics;
     std::string clientId;
     std::string path;
 };

@@ -70,6 +70,14 @@ TEST_F(DeliveryRecoveryTest, ChangeForUnsubscribedCollectionWaitsForSubscription
     waitForRetries(log, "no such table");
     EXPECT_EQ((std::vector<std::string>{"app:known/z:9:1"}), heardSoFar());
     EXPECT_EQ((std::vector<std::string>{"z=z:1:1"}), rows(known->query("", -1, Direction::ASCENDING)));
+    // The metrics show the stall: three deliveries and the status notice
+    // wait, the notice's change still counts as PENDING.
+    auto stalled = s.store->getSyncMetrics();
+    ASSERT_TRUE(stalled);
+    EXPECT_TRUE(stalled->retrying);
+    EXPECT_NE(std::string::npos, stalled->lastError.find("no such table")) << stalled->lastError;
+    EXPECT_EQ(4u, stalled->waitingJobs);
+    EXPECT_EQ(1u, stalled->queuedPending);
 
     auto later = s.store->subscribeCollection("app:later");
     ASSERT_TRUE(later);
@@ -79,6 +87,11 @@ TEST_F(DeliveryRecoveryTest, ChangeForUnsubscribedCollectionWaitsForSubscription
               heardSoFar());
     EXPECT_EQ((std::vector<std::string>{"x=x:3:1"}), rows(later->query("", -1, Direction::ASCENDING)));
     EXPECT_EQ((std::vector<std::string>{"y=y:3:1", "z=z:2:1"}), rows(known->query("", -1, Direction::ASCENDING)));
+    ASSERT_TRUE(waitUntil([&] { return s.store->getSyncMetrics()->waitingJobs == 0; }));
+    auto recovered = s.store->getSyncMetrics();
+    EXPECT_FALSE(recovered->retrying);
+    EXPECT_EQ(0u, recovered->queuedPending);
+    EXPECT_EQ(1u, recovered->queuedSent);
 
     // The later changes' sequence number was kept: a reconnection continues
     // from there.

@@ -1,3 +1,4 @@
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <atomic>
@@ -15,6 +16,7 @@
 
 using lumivale::tessarine::ExponentialBackoff;
 using lumivale::tessarine::SerializedJobQueue;
+using testsupport::LogCapture;
 using Job = SerializedJobQueue::Job;
 using Events = std::vector<std::string>;
 using ms = std::chrono::milliseconds;
@@ -170,6 +172,49 @@ TEST(SerializedJobQueueTest, StopWaitsForTheRunningAttemptThenNothingRunsAndDest
     abandoned->waitFor(1);
     EXPECT_TRUE(destroyedPromptly(std::move(pausing)));  // ends the hour's pause
     EXPECT_EQ((Events{"A1"}), abandoned->waitFor(1));
+}
+
+// Retrying stays as it was; what changes is that a long failure is visible:
+// in the retry state at once, and in the log once past the threshold.
+TEST(SerializedJobQueueTest, JobFailingPastTheThresholdIsLoggedOnceWithItsReasonAndAgainWhenItRecovers) {
+    LogCapture capture;
+    std::atomic<bool> diskFull{true};
+    std::atomic<int> attempts{0};
+    auto log = std::make_shared<Log>();
+    SerializedJobQueue queue(std::make_shared<CountingThreadCreator>(), backoff(ms(1), 2, ms(4)), ms(0));
+    EXPECT_FALSE(queue.getRetryState().retrying);
+    auto before = std::chrono::system_clock::now();
+    queue.addJob(Job{[&] {
+        ++attempts;
+        if (diskFull) throw std::runtime_error("disk full");
+    }});
+    queue.addJob(job(log, "behind"));
+    ASSERT_TRUE(testsupport::waitUntil([&] { return attempts >= 5; }));
+    auto state = queue.getRetryState();
+    EXPECT_TRUE(state.retrying);
+    EXPECT_EQ("disk full", state.lastError);
+    EXPECT_LE(before, state.failingSince);
+    EXPECT_EQ(2u, queue.getWaitingJobCount());
+    auto stalled = capture.linesStartingWith("Store stalled: a job has been failing for ");
+    ASSERT_EQ(1u, stalled.size());  // once, not per attempt
+    EXPECT_EQ(6, stalled[0].priority);
+    EXPECT_THAT(stalled[0].message, ::testing::MatchesRegex("Store stalled: a job has been failing for [0-9]+ ms: disk full"));
+    EXPECT_TRUE(capture.linesStartingWith("Store recovered").empty());
+
+    diskFull = false;
+    EXPECT_EQ((Events{"behind1"}), log->waitFor(1));
+    ASSERT_TRUE(testsupport::waitUntil([&] { return queue.getWaitingJobCount() == 0; }));
+    EXPECT_FALSE(queue.getRetryState().retrying);
+    auto recovered = capture.linesStartingWith("Store recovered: a job succeeded after failing for ");
+    ASSERT_EQ(1u, recovered.size());
+    EXPECT_EQ(4, recovered[0].priority);
+
+    // Below the threshold a failing job stays quiet.
+    SerializedJobQueue patient(std::make_shared<CountingThreadCreator>(), backoff(ms(1), 2, ms(4)), std::chrono::hours(1));
+    patient.addJob(job(log, "brief", 3));
+    log->waitFor(5);
+    EXPECT_EQ(1u, capture.linesStartingWith("Store stalled").size());
+    EXPECT_EQ(1u, capture.linesStartingWith("Store recovered").size());
 }
 
 TEST(SerializedJobQueueTest, BrokenThreadCreatorOrBackoffFailsConstructionWithoutAWorker) {

@@ -3,6 +3,8 @@
 #include <fstream>
 
 #include "StoreTestSupport.h"
+#include "server/LoopbackTransport.h"
+#include "server/SyncServer.h"
 
 namespace {
 
@@ -99,6 +101,43 @@ TEST(TessarineTest, HandleOutlivesStoreAndTransportOutlivesBoth) {
     EXPECT_TRUE(s.transport->sentEvents().empty());
     std::lock_guard<std::mutex> lock(heardMutex);
     EXPECT_EQ(2u, heard.size());
+}
+
+// The metrics follow the queue through the whole round trip: it grows while
+// offline and empties once the server has persisted every change, again
+// after a reconnection.
+TEST(TessarineTest, SyncMetricsCountQueuedChangesOfflineAndFallToZeroOncePersisted) {
+    TempDir dir;
+    auto server = std::make_shared<lumivale::tessarine::server::SyncServer>();
+    auto transport = std::make_shared<lumivale::tessarine::server::LoopbackTransport>(server, 1);
+    auto store = Tessarine::open(dir.file("metrics.db"), transport, std::make_shared<testsupport::CountingThreadCreator>());
+    ASSERT_TRUE(store);
+    auto notes = store->subscribeCollection("app:notes");
+    for (const char* key : {"a", "b", "c"}) ASSERT_TRUE(notes->saveObject(key, key, std::vector<unsigned char>{1}));
+    auto offline = store->getSyncMetrics();  // not started: never connected
+    ASSERT_TRUE(offline);
+    EXPECT_EQ(3u, offline->queuedPending);
+    EXPECT_EQ(0u, offline->connections);
+    EXPECT_FALSE(offline->lastPersisted);
+
+    auto persisted = [&](uint64_t connections) {
+        return testsupport::waitUntil([&] {
+            auto m = store->getSyncMetrics();
+            return m->queuedChanges() == 0 && m->lastPersisted && m->connections == connections && m->waitingJobs == 0;
+        });
+    };
+    store->start();
+    ASSERT_TRUE(persisted(1));
+    auto first = *store->getSyncMetrics()->lastPersisted;
+    EXPECT_FALSE(store->getSyncMetrics()->retrying);
+
+    transport->disconnect();
+    ASSERT_TRUE(notes->saveObject("d", "d", std::vector<unsigned char>{2}));
+    EXPECT_EQ(1u, store->getSyncMetrics()->queuedChanges());
+    transport->connect();
+    ASSERT_TRUE(persisted(2));
+    EXPECT_LE(first, *store->getSyncMetrics()->lastPersisted);
+    EXPECT_EQ(4u, server->objects("app:notes").size());
 }
 
 }  // namespace

@@ -1,0 +1,57 @@
+#include "tessarine/JobRetryMonitor.h"
+
+#include "platform/Log.h"
+
+namespace lumivale {
+namespace tessarine {
+
+namespace {
+
+long long millisecondsSince(std::chrono::steady_clock::time_point start) {
+    return static_cast<long long>(
+        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - start).count());
+}
+
+}  // namespace
+
+JobRetryMonitor::JobRetryMonitor(std::chrono::milliseconds stallThreshold) : stallThreshold(stallThreshold) {}
+
+void JobRetryMonitor::attemptFailed(const std::string& error) {
+    long long failedFor = 0;
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        if (!current.retrying) {
+            current.retrying = true;
+            current.failingSince = std::chrono::system_clock::now();
+            failingSinceSteady = std::chrono::steady_clock::now();
+        }
+        current.lastError = error;
+        if (stallReported || std::chrono::steady_clock::now() - failingSinceSteady <= stallThreshold) return;
+        stallReported = true;
+        failedFor = millisecondsSince(failingSinceSteady);
+    }
+    lv_printLog(6, "tessarine", "Store stalled: a job has been failing for %lld ms: %s", failedFor, error.c_str());
+}
+
+void JobRetryMonitor::jobEnded(bool succeeded) {
+    bool reportRecovery = false;
+    long long failedFor = 0;
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        reportRecovery = succeeded && stallReported;
+        if (reportRecovery) failedFor = millisecondsSince(failingSinceSteady);
+        current = State();
+        stallReported = false;
+    }
+    if (reportRecovery) {
+        lv_printLog(4, "tessarine", "Store recovered: a job succeeded after failing for %lld ms", failedFor);
+    }
+}
+
+JobRetryMonitor::State JobRetryMonitor::state() const {
+    std::lock_guard<std::mutex> lock(mutex);
+    return current;
+}
+
+}  // namespace tessarine
+}  // namespace lumivale
