@@ -22,9 +22,10 @@ packages=(
   libgtest-dev libgmock-dev
   libbenchmark-dev
 )
-# The Java API and its checks (plain and clang configurations): the JDK,
+# The Java API and its checks (plain, asan and clang configurations): the JDK,
 # JUnit and npm for the Kotlin compiler; Debian's host liblog for the Android
-# log path (plain); clang and libc++ (clang).
+# log path (plain); clang and libc++ (clang). The cross configurations build
+# the JNI libraries, for which the JDK's headers and javac suffice.
 java_packages=(openjdk-17-jdk-headless junit4)
 # A Node.js installed from elsewhere brings its own npm, which Debian's npm
 # package would conflict with.
@@ -32,7 +33,9 @@ command -v npm >/dev/null || java_packages+=(npm)
 for config in "${@:-plain}"; do
   case "$config" in
     plain) packages+=("${java_packages[@]}" android-liblog-dev) ;;
+    asan) packages+=("${java_packages[@]}") ;;
     clang) packages+=("${java_packages[@]}" clang libc++-dev libc++abi-dev) ;;
+    aarch64|armhf) packages+=(openjdk-17-jdk-headless) ;;
   esac
 done
 foreign_archs=()
@@ -52,7 +55,7 @@ for p in "${packages[@]}"; do
 done
 # The Kotlin compiler (common.sh) comes from npm once npm is installed.
 install_kotlin() {
-  case " ${*:-plain} " in *" plain "*|*" clang "*) ;; *) return 0 ;; esac
+  case " ${*:-plain} " in *" plain "*|*" asan "*|*" clang "*) ;; *) return 0 ;; esac
   [ -x "$kotlinc_path" ] && return 0
   echo "setup: installing kotlin-compiler $kotlin_version from npm"
   npm install --silent --no-audit --no-fund --prefix "$kotlin_prefix" "kotlin-compiler@$kotlin_version" >/dev/null
