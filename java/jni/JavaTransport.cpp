@@ -1,6 +1,7 @@
 #include "JavaTransport.h"
 
 #include "Marshal.h"
+#include "NativeCall.h"
 #include "platform/Log.h"
 
 namespace lumivale {
@@ -19,7 +20,7 @@ void JavaTransport::start() {
         LocalFrame frame(env, kCallFrame);
         auto target = std::make_unique<TransportEventsTarget>(shared_from_this());
         jobject events = env->NewObject(javaClasses().transportEvents, javaClasses().transportEventsInit,
-                                        reinterpret_cast<jlong>(target.get()));
+                                        toHandle(target.get()));
         if (env->ExceptionCheck()) {
             takeJavaException(env, "new TransportEvents");
             return;

@@ -5,6 +5,8 @@
 
 #include <jni.h>
 
+#include <cstdint>
+
 #include "JniSupport.h"
 
 namespace lumivale {
@@ -30,14 +32,16 @@ void nativeCall(JNIEnv* env, Body body) noexcept {
     }
 }
 
+// Native objects travel to Java as a long; through intptr_t, so that 32-bit
+// ABIs convert between sizes explicitly.
 template <typename T>
 T* fromHandle(jlong pointer) {
-    return reinterpret_cast<T*>(pointer);
+    return reinterpret_cast<T*>(static_cast<std::intptr_t>(pointer));
 }
 
 template <typename T>
 jlong toHandle(T* pointer) {
-    return reinterpret_cast<jlong>(pointer);
+    return static_cast<jlong>(reinterpret_cast<std::intptr_t>(pointer));
 }
 
 }  // namespace jni
