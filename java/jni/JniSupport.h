@@ -18,7 +18,8 @@
 // callback as it treats a throwing native one. Native to Java,
 // throwToJava() turns the exception being handled into a pending Java
 // exception: TessarineException for the library's own errors,
-// OutOfMemoryError for std::bad_alloc.
+// IllegalArgumentException for std::invalid_argument (a null string, an
+// unknown status number), OutOfMemoryError for std::bad_alloc.
 #pragma once
 
 #include <jni.h>
