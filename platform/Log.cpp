@@ -6,7 +6,10 @@
 #include <mutex>
 #include <vector>
 
-#ifdef __ANDROID__
+// On Android lines go to the Android log. TESSARINE_ANDROID_LOG takes that
+// path in a host build too, linked to a host liblog, to test it.
+#if defined(__ANDROID__) || defined(TESSARINE_ANDROID_LOG)
+#define TESSARINE_LOG_TO_ANDROID 1
 #include <android/log.h>
 #endif
 
@@ -41,7 +44,7 @@ std::string formatMessage(const char* format, va_list args) {
     return std::string(buffer.data(), static_cast<size_t>(length));
 }
 
-#ifndef __ANDROID__
+#ifndef TESSARINE_LOG_TO_ANDROID
 char priorityLetter(int priority) {
     static const char letters[] = "VDIWEF";
     return priority >= 2 && priority <= 7 ? letters[priority - 2] : '?';
@@ -71,7 +74,7 @@ extern "C" void lv_vprintLog(int priority, const char* tag, const char* format, 
         (*sink)(priority, tag, formatMessage(format, args));
         return;
     }
-#ifdef __ANDROID__
+#ifdef TESSARINE_LOG_TO_ANDROID
     __android_log_vprint(priority, tag, format, args);
 #else
     writeToStandardError(priority, tag, formatMessage(format, args));

@@ -34,3 +34,10 @@ cross_debian_arch() {
     armhf) echo armhf ;;
   esac
 }
+
+# The Kotlin compiler for the Kotlin check of the Java API: the npm registry's
+# kotlin-compiler package (Debian's kotlin is too old for JDK 17), pinned,
+# installed by setup.sh into the cache outside the checkout.
+kotlin_version="2.4.20"
+kotlin_prefix="${XDG_CACHE_HOME:-$HOME/.cache}/tessarine/kotlin-compiler-$kotlin_version"
+kotlinc_path="$kotlin_prefix/node_modules/kotlin-compiler/bin/kotlinc"

@@ -22,6 +22,22 @@ packages=(
   libgtest-dev libgmock-dev
   libbenchmark-dev
 )
+# The Java API and its checks (plain, asan and clang configurations): the JDK,
+# JUnit and npm for the Kotlin compiler; Debian's host liblog for the Android
+# log path (plain); clang and libc++ (clang). The cross configurations build
+# the JNI libraries, for which the JDK's headers and javac suffice.
+java_packages=(openjdk-17-jdk-headless junit4)
+# A Node.js installed from elsewhere brings its own npm, which Debian's npm
+# package would conflict with.
+command -v npm >/dev/null || java_packages+=(npm)
+for config in "${@:-plain}"; do
+  case "$config" in
+    plain) packages+=("${java_packages[@]}" android-liblog-dev) ;;
+    asan) packages+=("${java_packages[@]}") ;;
+    clang) packages+=("${java_packages[@]}" clang libc++-dev libc++abi-dev) ;;
+    aarch64|armhf) packages+=(openjdk-17-jdk-headless) ;;
+  esac
+done
 foreign_archs=()
 for config in "$@"; do
   arch="$(cross_debian_arch "$config")"
@@ -37,7 +53,17 @@ for p in "${packages[@]}"; do
     missing+=("$p")
   fi
 done
-[ ${#missing[@]} -eq 0 ] && exit 0
+# The Kotlin compiler (common.sh) comes from npm once npm is installed.
+install_kotlin() {
+  case " ${*:-plain} " in *" plain "*|*" asan "*|*" clang "*) ;; *) return 0 ;; esac
+  [ -x "$kotlinc_path" ] && return 0
+  echo "setup: installing kotlin-compiler $kotlin_version from npm"
+  npm install --silent --no-audit --no-fund --prefix "$kotlin_prefix" "kotlin-compiler@$kotlin_version" >/dev/null
+}
+if [ ${#missing[@]} -eq 0 ]; then
+  install_kotlin "$@"
+  exit 0
+fi
 
 echo "setup: installing ${missing[*]}"
 sudo=""
@@ -50,3 +76,4 @@ done
 # others are fine; the install below then says whether what it needs is there.
 $sudo apt-get update -qq || echo "setup: some package indexes could not be updated" >&2
 $sudo apt-get install -y -qq --no-install-recommends "${missing[@]}" >/dev/null
+install_kotlin "$@"

@@ -3,17 +3,18 @@
 # configuration, in this order: plain (warnings are errors; also checks the
 # installed package), asan (AddressSanitizer + UndefinedBehaviorSanitizer),
 # tsan (ThreadSanitizer, for the worker thread and the transport's callback
-# registries), then the ARM cross builds aarch64 (Android's arm64-v8a) and
+# registries), clang (clang++ with libc++, as the Android NDK builds), then the
+# ARM cross builds aarch64 (Android's arm64-v8a) and
 # armhf (armeabi-v7a), built with Debian's cross compilers and run under
 # qemu-user. Any sanitizer report fails the run.
 #
 #   scripts/test.sh              every configuration
-#   scripts/test.sh aarch64 ...  only the named ones (plain, asan, tsan, aarch64, armhf)
+#   scripts/test.sh aarch64 ...  only the named ones (plain, asan, tsan, clang, aarch64, armhf)
 set -euo pipefail
 source "$(dirname "${BASH_SOURCE[0]}")/common.sh"
 
 configs=("$@")
-[ ${#configs[@]} -eq 0 ] && configs=(plain asan tsan aarch64 armhf)
+[ ${#configs[@]} -eq 0 ] && configs=(plain asan tsan clang aarch64 armhf)
 "$repo_root/scripts/setup.sh" "${configs[@]}"
 
 export ASAN_OPTIONS="halt_on_error=1:abort_on_error=1:detect_leaks=1:strict_string_checks=1"
@@ -29,21 +30,41 @@ death_test_style() {
 }
 
 
+# The Java API is built on purpose where it is tested, so that a missing JDK
+# fails the run rather than dropping the Java tests.
+java_options=(-DTESSARINE_BUILD_JAVA=ON -DTESSARINE_KOTLIN_CHECK=ON "-DTESSARINE_KOTLINC=$kotlinc_path")
+
 configure() {
   case "$1" in
-    plain) configure_build plain -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON -DTESSARINE_BUILD_BENCHMARKS=ON ;;
+    plain) configure_build plain -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON -DTESSARINE_BUILD_BENCHMARKS=ON \
+             "${java_options[@]}" -DTESSARINE_ANDROID_LOG_TEST=ON ;;
+    # The stand-in for the Android NDK's c++_shared runtime: clang with
+    # libc++, GoogleTest compiled from Debian's sources against it (Debian's
+    # libraries are built for libstdc++, as are Google Benchmark's, so the
+    # benchmarks are left out). The consumer-project checks build with the
+    # default compiler and so are left out too.
+    clang) CC=clang CXX=clang++ configure_build clang -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON \
+             -DCMAKE_CXX_FLAGS=-stdlib=libc++ -DCMAKE_EXE_LINKER_FLAGS=-stdlib=libc++ \
+             -DCMAKE_SHARED_LINKER_FLAGS=-stdlib=libc++ -DTESSARINE_GTEST_SOURCE_DIR=/usr/src/googletest \
+             -DTESSARINE_PACKAGE_TEST=OFF "${java_options[@]}" ;;
     asan)  configure_build asan -DCMAKE_BUILD_TYPE=Debug -DTESSARINE_WERROR=ON \
-             -DTESSARINE_SANITIZE=address,undefined -DTESSARINE_PACKAGE_TEST=OFF ;;
+             -DTESSARINE_SANITIZE=address,undefined -DTESSARINE_PACKAGE_TEST=OFF "${java_options[@]}" ;;
+    # The Java API is left out under ThreadSanitizer: the JVM is not
+    # instrumented, so its synchronisation (monitors, the queues through
+    # which a Java transport hands payloads between threads) is invisible to
+    # it, and it reports those handoffs as races in the JNI code.
     tsan)  configure_build tsan -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON \
-             -DTESSARINE_SANITIZE=thread -DTESSARINE_PACKAGE_TEST=OFF ;;
+             -DTESSARINE_SANITIZE=thread -DTESSARINE_PACKAGE_TEST=OFF -DTESSARINE_BUILD_JAVA=OFF ;;
     # setup.sh installs only the target's SQLite runtime, without the
     # libsqlite3.so link, so the library is named here, as an Android app
-    # names a prebuilt SQLite of its own.
+    # names a prebuilt SQLite of its own. The JNI libraries are built as an
+    # app would ship them (and checked for 16 KB pages on aarch64); their
+    # tests need a JVM for the target, which the emulator does not have.
     aarch64|armhf)
       local triple; triple="$(cross_triple "$1")"
       configure_build "$1" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON \
         -DCMAKE_TOOLCHAIN_FILE="$repo_root/cmake/toolchains/$triple.cmake" \
-        -DSQLite3_LIBRARY="/usr/lib/$triple/libsqlite3.so.0" ;;
+        -DSQLite3_LIBRARY="/usr/lib/$triple/libsqlite3.so.0" -DTESSARINE_BUILD_JAVA=ON ;;
     *) echo "unknown configuration: $1" >&2; exit 2 ;;
   esac
 }

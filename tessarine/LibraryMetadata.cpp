@@ -13,8 +13,11 @@ const std::string LibraryMetadata::KEY_VERSION = "version";
 
 namespace {
 
+// Seeded from the C++ runtime's default random source. No token is named:
+// its meaning belongs to the runtime (libstdc++ knows "default", libc++, as
+// the Android NDK ships it, takes a device path and fails on that word).
 struct RandomSource {
-    RandomSource() : engine(std::random_device("default")()) {}
+    RandomSource() : engine(std::random_device()()) {}
     std::mutex mutex;
     std::mt19937 engine;
     std::uniform_int_distribution<uint32_t> distribution{0, 4294967295u};

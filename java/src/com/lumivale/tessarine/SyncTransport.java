@@ -1,0 +1,37 @@
+package com.lumivale.tessarine;
+
+/**
+ * A transport written in Java: the store's link to its server over the
+ * application's own networking. The store calls these four operations; the
+ * transport reports what its connection delivers through the
+ * {@link TransportEvents} it is given in start(). {@link Wire} turns the
+ * records into the server's wire payloads and back.
+ *
+ * Threads: the operations are called on application threads that write and
+ * on the thread that reports a connection (the store subscribes and resends
+ * from inside connectionEstablished()), possibly at once; sendDelta of a local
+ * write runs inside the write's transaction, so it must hand the change to
+ * the connection and return, never wait for the store. Report events from
+ * the transport's own threads rather than from inside these calls.
+ *
+ * Errors: an exception thrown by an operation is logged (tag "tessarine_jni")
+ * and reaches the store as a throwing native transport's would: thrown by
+ * the sendDelta of a local write it fails that write (save returns false and
+ * nothing is stored); thrown while the store subscribes or resends on a new
+ * connection it ends that round, which the next connection makes again. One
+ * thrown by start() is logged and the store then waits for a connection that
+ * never comes.
+ */
+public interface SyncTransport {
+    /** Begins connecting; events reports each connection and everything received. */
+    void start(TransportEvents events);
+
+    /** Publishes a subscription (on Wire.TOPIC_SUBSCRIBE_COLLECTION). */
+    void sendSubscriptionRequest(SubscriptionRequest request);
+
+    /** Publishes one local change (on Wire.TOPIC_CHANGE_RECORD); the result is not read by the store. */
+    int sendDelta(SyncDelta delta);
+
+    /** Asks for a snapshot of a collection (on Wire.TOPIC_SNAPSHOT); the store itself never calls it. */
+    void sendSnapshotRequest(String collectionName, String clientId);
+}
