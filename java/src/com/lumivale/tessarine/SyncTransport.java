@@ -9,15 +9,17 @@ package com.lumivale.tessarine;
  *
  * Threads: the operations are called on application threads that write and
  * on the thread that reports a connection (the store subscribes and resends
- * from inside connectionEstablished()), possibly at once; sendDelta of a local
- * write runs inside the write's transaction, so it must hand the change to
- * the connection and return, never wait for the store. Report events from
- * the transport's own threads rather than from inside these calls.
+ * from inside connectionEstablished()); the store calls sendDelta on one
+ * thread at a time, after the change has been stored, holding none of its
+ * locks. It should hand the change to the connection and return. Report
+ * events from the transport's own threads rather than from inside these
+ * calls.
  *
  * Errors: an exception thrown by an operation is logged (tag "tessarine_jni")
  * and reaches the store as a throwing native transport's would: thrown by
- * the sendDelta of a local write it fails that write (save returns false and
- * nothing is stored); thrown while the store subscribes or resends on a new
+ * sendDelta it means the change was not taken; the write still succeeds, the
+ * change stays queued (PENDING), and nothing newer is sent until the next
+ * connection resends the queue; thrown while the store subscribes on a new
  * connection it ends that round, which the next connection makes again. One
  * thrown by start() is logged and the store then waits for a connection that
  * never comes.
