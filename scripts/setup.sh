@@ -21,6 +21,7 @@ packages=(
   libflatbuffers-dev flatbuffers-compiler
   libgtest-dev libgmock-dev
   libbenchmark-dev
+  libmosquitto-dev mosquitto mosquitto-clients
 )
 foreign_archs=()
 for config in "$@"; do

@@ -13,9 +13,11 @@ constexpr const char* kChangeColumns =
 
 std::unique_ptr<sqlite::Database> openDatabase(const std::string& path) {
     auto database = std::make_unique<sqlite::Database>(path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE);
+    // First, so that opening waits for readers of the file (and the recovery
+    // after a crash) instead of failing.
+    database->exec("PRAGMA busy_timeout = 5000");
     database->exec("PRAGMA journal_mode = WAL");
     database->exec("PRAGMA synchronous = FULL");
-    database->exec("PRAGMA busy_timeout = 5000");
     database->exec(
         "CREATE TABLE IF NOT EXISTS changes ("
         " collection TEXT NOT NULL, sequence INTEGER NOT NULL, client_id TEXT NOT NULL,"
