@@ -25,7 +25,7 @@ NetworkSyncServer::NetworkSyncServer(const Options& options)
       connection(options.broker, "tessarine-server",
                  mqtt::MqttConnection::Handlers{
                      [this] { handleConnected(); },
-                     [this](const std::string& topic, std::vector<unsigned char> payload) {
+                     [this](const std::string& topic, std::vector<unsigned char> payload, bool) {
                          handleMessage(topic, payload);
                      },
                      nullptr, nullptr}) {

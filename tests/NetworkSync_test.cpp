@@ -281,19 +281,29 @@ TEST_F(EmbeddedSyncTest, HostilePayloadsOnEveryTopicAreDroppedAndServingGoesOn) 
     oversized.clientId = "intruder";
     oversized.blob.assign(8192, 'x');
 
-    // The intruder also listens to every client's topic, to learn a store's.
+    // The intruder waits for the server to be online, and listens to every
+    // client's topic to learn a store's.
     std::mutex mutex;
+    bool serverOnline = false;
     std::string storeTopic;
     ts::mqtt::MqttConnection intruder(options, "intruder",
                                       {nullptr,
-                                       [&](const std::string& topic, std::vector<unsigned char>) {
+                                       [&](const std::string& topic, std::vector<unsigned char>, bool) {
                                            std::lock_guard<std::mutex> lock(mutex);
-                                           storeTopic = topic;
+                                           if (topic == ts::mqtt::TOPIC_SERVER_ONLINE) {
+                                               serverOnline = true;
+                                           } else {
+                                               storeTopic = topic;
+                                           }
                                        },
                                        nullptr, nullptr});
+    intruder.subscribe(ts::mqtt::TOPIC_SERVER_ONLINE);
     intruder.subscribe(ts::mqtt::clientTopic("#"));
     intruder.start();
-    ASSERT_TRUE(waitUntil([&] { return intruder.isConnected(); }));
+    ASSERT_TRUE(waitUntil([&] {
+        std::lock_guard<std::mutex> lock(mutex);
+        return serverOnline && intruder.isConnected();
+    }));
     for (const Hostile& hostile : droppedByRules) ASSERT_GT(intruder.publish(hostile.topic, hostile.payload), 0);
     ASSERT_GT(intruder.publish(ts::protocol::TOPIC_CHANGE_RECORD, ts::protocol::makePayloadForSendDelta(oversized)), 0);
 

@@ -32,42 +32,49 @@ std::string clientTopic(const std::string& clientId) { return "/tessarine_client
 MqttConnection::MqttConnection(const ConnectionOptions& options, std::string name, Handlers handlers)
     : settings(options), name(std::move(name)), handlers(std::move(handlers)) {
     initialiseLibrary();
-    client = mosquitto_new(nullptr, true, this);
-    if (client == nullptr) throw std::runtime_error(this->name + ": cannot create an MQTT client");
+    client = createClient();
+}
+
+struct mosquitto* MqttConnection::createClient() {
+    struct mosquitto* created = mosquitto_new(nullptr, true, this);
+    if (created == nullptr) throw std::runtime_error(name + ": cannot create an MQTT client");
     try {
-        require(mosquitto_int_option(client, MOSQ_OPT_PROTOCOL_VERSION, MQTT_PROTOCOL_V311), "MQTT 3.1.1");
+        require(mosquitto_int_option(created, MOSQ_OPT_PROTOCOL_VERSION, MQTT_PROTOCOL_V311), "MQTT 3.1.1");
         if (!settings.username.empty()) {
-            require(mosquitto_username_pw_set(client, settings.username.c_str(),
+            require(mosquitto_username_pw_set(created, settings.username.c_str(),
                                               settings.password.empty() ? nullptr : settings.password.c_str()),
                     "credentials");
         }
         if (!settings.caFile.empty()) {
-            require(mosquitto_tls_set(client, settings.caFile.c_str(), nullptr, nullptr, nullptr, nullptr),
+            require(mosquitto_tls_set(created, settings.caFile.c_str(), nullptr, nullptr, nullptr, nullptr),
                     "TLS CA file " + settings.caFile);
         }
-        require(mosquitto_reconnect_delay_set(client, settings.minReconnectDelaySeconds,
+        require(mosquitto_reconnect_delay_set(created, settings.minReconnectDelaySeconds,
                                               settings.maxReconnectDelaySeconds, true),
                 "reconnect delays");
     } catch (...) {
-        mosquitto_destroy(client);
+        mosquitto_destroy(created);
         throw;
     }
-    mosquitto_connect_callback_set(client, &MqttConnection::onConnect);
-    mosquitto_disconnect_callback_set(client, &MqttConnection::onDisconnect);
-    mosquitto_message_callback_set(client, &MqttConnection::onMessage);
-    mosquitto_publish_callback_set(client, &MqttConnection::onPublish);
+    mosquitto_connect_callback_set(created, &MqttConnection::onConnect);
+    mosquitto_disconnect_callback_set(created, &MqttConnection::onDisconnect);
+    mosquitto_message_callback_set(created, &MqttConnection::onMessage);
+    mosquitto_publish_callback_set(created, &MqttConnection::onPublish);
+    return created;
 }
 
 MqttConnection::~MqttConnection() {
-    if (started) {
-        mosquitto_disconnect(client);
-        mosquitto_loop_stop(client, false);
-    }
-    mosquitto_destroy(client);
+    stop();
+    if (client != nullptr) mosquitto_destroy(client);
 }
 
 void MqttConnection::start() {
     if (started) return;
+    if (client == nullptr) {
+        struct mosquitto* created = createClient();
+        std::unique_lock<std::shared_mutex> lock(clientMutex);
+        client = created;
+    }
     started = true;
     require(mosquitto_loop_start(client), name + ": cannot start the network thread");
     // The thread runs first: then a first attempt that fails is retried with
@@ -80,16 +87,31 @@ void MqttConnection::start() {
     }
 }
 
+void MqttConnection::stop() {
+    if (!started) return;
+    // The thread is joined before the client goes, and without the lock:
+    // its handlers may be publishing.
+    mosquitto_disconnect(client);
+    mosquitto_loop_stop(client, false);
+    connected = false;
+    started = false;
+    std::unique_lock<std::shared_mutex> lock(clientMutex);
+    mosquitto_destroy(client);
+    client = nullptr;
+}
+
 void MqttConnection::subscribe(const std::string& topic) {
     {
         std::lock_guard<std::mutex> lock(topicsMutex);
         if (!topics.insert(topic).second) return;
     }
-    if (connected) mosquitto_subscribe(client, nullptr, topic.c_str(), kQos);
+    std::shared_lock<std::shared_mutex> lock(clientMutex);
+    if (connected && client != nullptr) mosquitto_subscribe(client, nullptr, topic.c_str(), kQos);
 }
 
 int MqttConnection::publish(const std::string& topic, const std::vector<unsigned char>& payload, bool retain) {
-    if (!connected) return 0;
+    std::shared_lock<std::shared_mutex> lock(clientMutex);
+    if (!connected || client == nullptr) return 0;
     int messageId = 0;
     int rc = mosquitto_publish(client, &messageId, topic.c_str(), static_cast<int>(payload.size()), payload.data(),
                                kQos, retain);
@@ -103,8 +125,8 @@ int MqttConnection::publish(const std::string& topic, const std::vector<unsigned
 
 bool MqttConnection::isConnected() const { return connected; }
 
-void MqttConnection::onConnect(struct mosquitto*, void* self, int rc) {
-    static_cast<MqttConnection*>(self)->handleConnect(rc);
+void MqttConnection::onConnect(struct mosquitto* mosq, void* self, int rc) {
+    static_cast<MqttConnection*>(self)->handleConnect(mosq, rc);
 }
 
 void MqttConnection::onDisconnect(struct mosquitto*, void* self, int rc) {
@@ -125,7 +147,7 @@ void MqttConnection::onPublish(struct mosquitto*, void* self, int messageId) {
     }
 }
 
-void MqttConnection::handleConnect(int rc) {
+void MqttConnection::handleConnect(struct mosquitto* mosq, int rc) {
     if (rc != 0) {
         lv_printLog(5, kTag, "%s: connection refused: %s", name.c_str(), mosquitto_connack_string(rc));
         return;
@@ -138,7 +160,7 @@ void MqttConnection::handleConnect(int rc) {
         std::lock_guard<std::mutex> lock(topicsMutex);
         subscribed = topics;
     }
-    for (const std::string& topic : subscribed) mosquitto_subscribe(client, nullptr, topic.c_str(), kQos);
+    for (const std::string& topic : subscribed) mosquitto_subscribe(mosq, nullptr, topic.c_str(), kQos);
     lv_printLog(4, kTag, "%s: connected to %s:%d", name.c_str(), settings.host.c_str(), settings.port);
     if (handlers.connected) guard("connected", handlers.connected);
 }
@@ -153,7 +175,7 @@ void MqttConnection::handleMessage(const struct mosquitto_message& message) {
     if (!handlers.message) return;
     const auto* bytes = static_cast<const unsigned char*>(message.payload);
     std::string topic = message.topic;
-    guard("message", [&] { handlers.message(topic, std::vector<unsigned char>(bytes, bytes + size)); });
+    guard("message", [&] { handlers.message(topic, std::vector<unsigned char>(bytes, bytes + size), message.retain); });
 }
 
 void MqttConnection::guard(const char* what, const std::function<void()>& body) {

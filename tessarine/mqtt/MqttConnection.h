@@ -7,7 +7,8 @@
 // time, never under a lock of this class:
 //   - connected: a connection is up and its subscriptions have been asked
 //     for (the broker handles them before anything published after them);
-//   - message: a message arrived on a subscribed topic;
+//   - message: a message arrived on a subscribed topic (retained: the broker
+//     kept it from before this connection's subscription);
 //   - published: the broker acknowledged the publish with that message id;
 //   - disconnected: the connection went down (or an attempt failed).
 // An exception a handler throws is logged and goes no further. A refused
@@ -15,7 +16,7 @@
 // ("<name>: connection refused: <reason>") and tried again after the back-off.
 //
 // Threads: every operation may be called from any thread, handlers
-// included. The destructor disconnects and joins the network thread, after
+// included, except that start() and stop() must not run at the same time. The destructor disconnects and joins the network thread, after
 // which no handler runs; it must not run on that thread.
 //
 // Errors: the constructor throws std::runtime_error when the options cannot be
@@ -26,6 +27,7 @@
 #include <functional>
 #include <mutex>
 #include <set>
+#include <shared_mutex>
 #include <string>
 #include <vector>
 
@@ -65,7 +67,7 @@ class MqttConnection {
 public:
     struct Handlers {
         std::function<void()> connected;
-        std::function<void(const std::string& topic, std::vector<unsigned char> payload)> message;
+        std::function<void(const std::string& topic, std::vector<unsigned char> payload, bool retained)> message;
         std::function<void(int messageId)> published;
         std::function<void()> disconnected;
     };
@@ -76,8 +78,11 @@ public:
     MqttConnection(const MqttConnection&) = delete;
     MqttConnection& operator=(const MqttConnection&) = delete;
 
-    // Starts connecting in the background. Once only.
+    // Starts connecting in the background; nothing happens when started.
     void start();
+    // Disconnects and joins the network thread (the disconnected handler
+    // runs); start() connects again. Not on the network thread.
+    void stop();
 
     // Subscribes (QoS 1) to topic now when connected, and on every connection
     // from now on.
@@ -94,11 +99,14 @@ public:
     const ConnectionOptions& options() const { return settings; }
 
 private:
+    // A new client with the options and callbacks applied; throws for
+    // options that cannot be used.
+    struct mosquitto* createClient();
     static void onConnect(struct mosquitto*, void* self, int rc);
     static void onDisconnect(struct mosquitto*, void* self, int rc);
     static void onMessage(struct mosquitto*, void* self, const struct mosquitto_message* message);
     static void onPublish(struct mosquitto*, void* self, int messageId);
-    void handleConnect(int rc);
+    void handleConnect(struct mosquitto* mosq, int rc);
     void handleMessage(const struct mosquitto_message& message);
     // Runs a handler, logging what it throws.
     void guard(const char* what, const std::function<void()>& body);
@@ -106,6 +114,11 @@ private:
     const ConnectionOptions settings;
     const std::string name;
     const Handlers handlers;
+    // A client lives from start() to stop() (libmosquitto does not restart
+    // a stopped network thread reliably, so each start has a fresh one).
+    // Shared while in use by publish and subscribe; replaced only once its
+    // thread has been joined.
+    std::shared_mutex clientMutex;
     struct mosquitto* client = nullptr;
     std::atomic<bool> connected{false};
     bool started = false;

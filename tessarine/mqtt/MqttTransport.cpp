@@ -21,8 +21,8 @@ MqttTransport::MqttTransport(const Options& options)
     : connection(options, kName,
                  MqttConnection::Handlers{
                      [this] { handleConnected(); },
-                     [this](const std::string& topic, std::vector<unsigned char> payload) {
-                         handleMessage(topic, payload);
+                     [this](const std::string& topic, std::vector<unsigned char> payload, bool retained) {
+                         handleMessage(topic, payload, retained);
                      },
                      [this](int messageId) { handlePublished(messageId); },
                      [this] { handleDisconnected(); }}) {
@@ -32,6 +32,10 @@ MqttTransport::MqttTransport(const Options& options)
 MqttTransport::~MqttTransport() = default;
 
 void MqttTransport::start() { connection.start(); }
+
+void MqttTransport::disconnect() { connection.stop(); }
+
+void MqttTransport::connect() { connection.start(); }
 
 bool MqttTransport::isConnected() const { return connection.isConnected(); }
 
@@ -119,20 +123,24 @@ void MqttTransport::resynchronise() {
     ready = connection.isConnected();
 }
 
-void MqttTransport::handleMessage(const std::string& topic, const std::vector<unsigned char>& payload) {
+void MqttTransport::handleMessage(const std::string& topic, const std::vector<unsigned char>& payload,
+                                  bool retained) {
     if (topic == TOPIC_SERVER_ONLINE) {
-        handleServerOnline(payload);
+        handleServerOnline(payload, retained);
     } else {
         handleServerPayload(payload);
     }
 }
 
-void MqttTransport::handleServerOnline(const std::vector<unsigned char>& payload) {
+void MqttTransport::handleServerOnline(const std::vector<unsigned char>& payload, bool retained) {
     std::string token(payload.begin(), payload.end());
     {
         std::lock_guard<std::mutex> lock(mutex);
         if (token.empty() || token == serverToken) return;
         serverToken = token;
+        // The server was up before this connection subscribed, so before
+        // its resynchronisation.
+        if (retained) return;
         ready = false;
     }
     lv_printLog(4, kTag, "%s: the server is online (%s): subscribing and resending", kName, token.c_str());

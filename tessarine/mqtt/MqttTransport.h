@@ -14,9 +14,11 @@
 // Connection: start() connects in the background and keeps reconnecting with
 // back-off (Options). Every connection is reported by onConnectionEstablished
 // (the store then subscribes again and resends its queued changes), and so is
-// every new token the server publishes on TOPIC_SERVER_ONLINE: a server that
-// restarted or reconnected may have lost what was in flight, so the store
-// resends to it.
+// every new token the server publishes on TOPIC_SERVER_ONLINE while this
+// transport is connected: a server that restarted or reconnected may have
+// lost what was in flight, so the store resends to it. (The token the broker
+// kept, which arrives on every connection, names a server that was already
+// there when the connection's own resynchronisation ran.)
 //
 // Order: the server must see one client's changes in the order they were
 // written, also when some were lost on the way (a server or broker killed):
@@ -70,6 +72,12 @@ public:
     int sendDelta(const Delta& delta) override;
     void sendSnapshotRequest(const std::string& collectionName, const std::string& clientId) override;
 
+    // Takes the connection down until connect(), as an application does when
+    // it goes to the background; the store keeps its changes queued (PENDING)
+    // meanwhile. Not from inside a store callback (it joins the network thread).
+    void disconnect();
+    // Connects again after disconnect() (as start() does the first time).
+    void connect();
     // True while connected to the broker.
     bool isConnected() const;
 
@@ -81,8 +89,8 @@ private:
     void resynchronise();
     void handleConnected();
     void handleDisconnected();
-    void handleMessage(const std::string& topic, const std::vector<unsigned char>& payload);
-    void handleServerOnline(const std::vector<unsigned char>& payload);
+    void handleMessage(const std::string& topic, const std::vector<unsigned char>& payload, bool retained);
+    void handleServerOnline(const std::vector<unsigned char>& payload, bool retained);
     void handleServerPayload(const std::vector<unsigned char>& payload);
     void handlePublished(int messageId);
 
