@@ -522,7 +522,7 @@ bool runDemo(Setup& setup) {
     std::string config = setup.folder + "/mosquitto.conf";
     {
         std::ofstream out(config);
-        out << "listener " << setup.port << " 127.0.0.1\nallow_anonymous true\nlog_type error\n";
+        out << "listener " << setup.port << " 127.0.0.1\nallow_anonymous true\nset_tcp_nodelay true\nlog_type error\n";
         // As root, mosquitto would otherwise switch to a user that may not
         // read the folder.
         if (geteuid() == 0) out << "user root\n";

@@ -45,6 +45,8 @@ run remote_apply remote_apply_bench
 run queries queries_bench
 run resend resend_bench --benchmark_filter='^resend/'
 run scale scale_bench
+# Networked sync through a mosquitto broker on loopback that the program starts.
+run network network_bench
 # The memory of one resend of 100 000 queued deltas, each side in a process of
 # its own so that neither's peak hides the other's.
 run resend_memory_ours resend_bench --benchmark_filter='^resend_memory/ours/' --benchmark_repetitions=1

@@ -53,7 +53,7 @@ public:
     explicit MqttBroker(const TempDir& dir, const std::string& user = "", const std::string& password = "")
         : port(freePort()), config(dir.file("mosquitto.conf")) {
         std::ofstream out(config);
-        out << "listener " << port << " 127.0.0.1\nlog_type error\nlog_type warning\n";
+        out << "listener " << port << " 127.0.0.1\nset_tcp_nodelay true\nlog_type error\nlog_type warning\n";
         // As root, mosquitto would otherwise switch to a user that may not
         // read the temporary directory.
         if (::geteuid() == 0) out << "user root\n";

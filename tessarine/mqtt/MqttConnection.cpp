@@ -40,6 +40,9 @@ struct mosquitto* MqttConnection::createClient() {
     if (created == nullptr) throw std::runtime_error(name + ": cannot create an MQTT client");
     try {
         require(mosquitto_int_option(created, MOSQ_OPT_PROTOCOL_VERSION, MQTT_PROTOCOL_V311), "MQTT 3.1.1");
+        // Small messages each waiting for an acknowledgement: without this,
+        // Nagle's algorithm and delayed ACKs add tens of milliseconds to each.
+        require(mosquitto_int_option(created, MOSQ_OPT_TCP_NODELAY, 1), "TCP_NODELAY");
         if (!settings.username.empty()) {
             require(mosquitto_username_pw_set(created, settings.username.c_str(),
                                               settings.password.empty() ? nullptr : settings.password.c_str()),
