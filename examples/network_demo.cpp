@@ -72,6 +72,8 @@ void usage(const char* program) {
         "The files go to a fresh temporary folder that is removed at the end, or to FOLDER,\n"
         "which is kept (it must be new or empty).\n"
         "  --server PATH   the tessarine-server program (default: the one built beside this)\n"
+        "  --emulator CMD  runs the server and the devices through CMD (words separated by\n"
+        "                  blanks), as a cross build's tests run its programs\n"
         "  --verbose       also print the library's debug log lines\n",
         program);
 }
@@ -305,6 +307,13 @@ struct Setup {
     bool verbose = false;
     int port = 0;
     int64_t startMs = 0;
+    std::vector<std::string> emulator;  // prefixed to the server's and the devices' command lines
+
+    // arguments, run through the emulator if there is one.
+    std::vector<std::string> emulated(std::vector<std::string> arguments) const {
+        arguments.insert(arguments.begin(), emulator.begin(), emulator.end());
+        return arguments;
+    }
 };
 
 // A device as the demo drives it: its process and its state file.
@@ -318,7 +327,7 @@ public:
         std::vector<std::string> arguments{setup.selfProgram, "--device", name, setup.folder + "/" + name + ".db",
                                            std::to_string(setup.port), statePath(), std::to_string(setup.startMs)};
         if (setup.verbose) arguments.push_back("--verbose");
-        process = std::make_unique<Child>(arguments, true);
+        process = std::make_unique<Child>(setup.emulated(arguments), true);
     }
     // Ends the process as an application ends: its store is closed.
     void quit() {
@@ -537,8 +546,8 @@ bool runDemo(Setup& setup) {
         std::this_thread::sleep_for(kPollPeriod);
     }
     say(setup.startMs, "demo", "broker: mosquitto on 127.0.0.1:" + std::to_string(setup.port));
-    Child server({setup.serverProgram, "--broker-port", std::to_string(setup.port), "--data",
-                  setup.folder + "/server.db"},
+    Child server(setup.emulated({setup.serverProgram, "--broker-port", std::to_string(setup.port), "--data",
+                                 setup.folder + "/server.db"}),
                  false);
     say(setup.startMs, "demo", "server: tessarine-server with " + setup.folder + "/server.db");
     return story(setup);
@@ -592,6 +601,9 @@ int main(int argc, char** argv) {
             setup.verbose = true;
         } else if (argument == "--server" && i + 1 < argc) {
             setup.serverProgram = argv[++i];
+        } else if (argument == "--emulator" && i + 1 < argc) {
+            std::istringstream words(argv[++i]);
+            for (std::string word; words >> word;) setup.emulator.push_back(word);
         } else if (!argument.empty() && argument[0] != '-' && setup.folder.empty()) {
             setup.folder = argument;
         } else {

@@ -28,6 +28,26 @@ death_test_style() {
   if [ -n "$(cross_triple "$1")" ]; then echo fast; else echo threadsafe; fi
 }
 
+# mosquitto_sysroot CONFIG: a folder under the build root holding the target's
+# libmosquitto1 and the libraries it loads (libssl3, libcjson1), unpacked from
+# Debian's packages, and the build machine's mosquitto.h (the same for every
+# architecture); prints its path. They cannot be installed as multiarch
+# packages: Debian wants one libssl3 version for both architectures, and the
+# target's index may hold another one than the build machine has.
+mosquitto_sysroot() {
+  local arch triple dir downloads deb
+  arch="$(cross_debian_arch "$1")"; triple="$(cross_triple "$1")"
+  dir="$build_root/$1-mosquitto"
+  if [ ! -e "$dir/usr/lib/$triple/libmosquitto.so.1" ]; then
+    downloads="$(mktemp -d)"
+    (cd "$downloads" && apt-get download -q "libmosquitto1:$arch" "libssl3:$arch" "libcjson1:$arch" >&2)
+    for deb in "$downloads"/*.deb; do dpkg-deb -x "$deb" "$dir"; done
+    rm -rf "$downloads"
+    mkdir -p "$dir/include"
+    cp /usr/include/mosquitto.h "$dir/include/"
+  fi
+  echo "$dir"
+}
 
 configure() {
   case "$1" in
@@ -41,16 +61,17 @@ configure() {
     # setup.sh installs only the target's SQLite runtime, without the
     # libsqlite3.so link, so the library is named here, as an Android app
     # names a prebuilt SQLite of its own.
-    # Without MQTT (the transport, the networked server and their tests): the
-    # target's libmosquitto1 cannot be installed beside the build machine's
-    # (Debian's multiarch wants one libssl3 version for both architectures,
-    # and the indexes here differ), and a private sysroot for it is not set
-    # up yet.
+    # libmosquitto comes from mosquitto_sysroot (below): linked by full path,
+    # its own libraries found through -rpath-link.
     aarch64|armhf)
-      local triple; triple="$(cross_triple "$1")"
-      configure_build "$1" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON -DTESSARINE_WITH_MQTT=OFF \
+      local triple sysroot; triple="$(cross_triple "$1")"; sysroot="$(mosquitto_sysroot "$1")"
+      configure_build "$1" -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON \
         -DCMAKE_TOOLCHAIN_FILE="$repo_root/cmake/toolchains/$triple.cmake" \
-        -DSQLite3_LIBRARY="/usr/lib/$triple/libsqlite3.so.0" ;;
+        -DSQLite3_LIBRARY="/usr/lib/$triple/libsqlite3.so.0" \
+        -DTESSARINE_WITH_MQTT=ON -DTESSARINE_MOSQUITTO_INCLUDE_DIR="$sysroot/include" \
+        -DTESSARINE_MOSQUITTO_LIBRARY="$sysroot/usr/lib/$triple/libmosquitto.so.1" \
+        -DCMAKE_EXE_LINKER_FLAGS="-Wl,-rpath-link,$sysroot/usr/lib/$triple" \
+        -DCMAKE_SHARED_LINKER_FLAGS="-Wl,-rpath-link,$sysroot/usr/lib/$triple" ;;
     *) echo "unknown configuration: $1" >&2; exit 2 ;;
   esac
 }
@@ -58,8 +79,13 @@ configure() {
 for config in "${configs[@]}"; do
   echo "== $config: build"
   configure "$config"
-  cmake --build "$build_root/$config"
+  # Emulated programs (the tests, also when they are listed during the build)
+  # find the target's libmosquitto and its libraries in the private folder;
+  # QEMU_SET_ENV reaches only emulated programs.
+  run_env=(GTEST_DEATH_TEST_STYLE="$(death_test_style "$config")")
+  triple="$(cross_triple "$config")"
+  [ -n "$triple" ] && run_env+=(QEMU_SET_ENV="LD_LIBRARY_PATH=$build_root/$config-mosquitto/usr/lib/$triple")
+  env "${run_env[@]}" cmake --build "$build_root/$config"
   echo "== $config: test"
-  GTEST_DEATH_TEST_STYLE="$(death_test_style "$config")" \
-    ctest --test-dir "$build_root/$config" --output-on-failure -j2 --timeout 600
+  env "${run_env[@]}" ctest --test-dir "$build_root/$config" --output-on-failure -j2 --timeout 600
 done
