@@ -44,8 +44,8 @@ public:
     explicit Broker(const ScratchDir& dir) {
         port = freePort();
         std::string config = dir.file("mosquitto.conf");
-        std::ofstream(config) << "listener " << port << " 127.0.0.1\nallow_anonymous true\nset_tcp_nodelay true\nlog_type error\n"
-                              << (geteuid() == 0 ? "user root\n" : "");
+        std::ofstream(config) << "listener " << port << " 127.0.0.1\nallow_anonymous true\n"
+                              << "set_tcp_nodelay true\nlog_type error\n" << (geteuid() == 0 ? "user root\n" : "");
         std::string program = "mosquitto", flag = "-c";
         char* argv[] = {program.data(), flag.data(), config.data(), nullptr};
         if (posix_spawnp(&pid, argv[0], nullptr, nullptr, argv, environ) != 0) throw std::runtime_error("no mosquitto");

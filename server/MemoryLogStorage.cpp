@@ -31,7 +31,8 @@ SyncProtocol::Delta MemoryLogStorage::append(const SyncProtocol::Delta& change) 
     if (change.type == SyncProtocol::DeltaType::DELETE) {
         collection.objects.erase(change.primaryKey);
     } else {
-        collection.objects[change.primaryKey] = SyncProtocol::TessarineObject{change.primaryKey, change.sortKey, change.blob};
+        collection.objects[change.primaryKey] =
+            SyncProtocol::TessarineObject{change.primaryKey, change.sortKey, change.blob};
     }
     return logged;
 }

@@ -54,7 +54,8 @@ void NetworkSyncServer::handleMessage(const std::string& topic, const std::vecto
     bool transient = false;
     SyncServer::SessionId session = sessionFor(topic, payload, transient);
     if (session == 0) {
-        lv_printLog(3, kTag, "tessarine-server: dropped a change from a client without a session; it resends after subscribing");
+        lv_printLog(3, kTag,
+                    "tessarine-server: dropped a change from a client without a session; it resends after subscribing");
         return;
     }
     server.receive(session, topic, payload);

@@ -69,6 +69,17 @@ public:
         return rows;
     }
 
+    std::vector<std::string> logRows() {
+        auto statement = database.prepare(
+            "SELECT sequence, version_id, primary_key, CAST(blob AS TEXT) FROM changes ORDER BY sequence");
+        std::vector<std::string> rows;
+        while (statement.step()) {
+            rows.push_back(std::to_string(statement(0).getInt64()) + "/" + std::to_string(statement(1).getInt64()) +
+                           "/" + statement(2).getText() + "=" + statement(3).getText());
+        }
+        return rows;
+    }
+
 private:
     lumivale::sqlite::Database database;
 };
@@ -120,10 +131,8 @@ protected:
         }
         text += "server:";
         for (const std::string& row : ServerFile(dir.file("server.db")).objectRows()) text += " " + row;
-        lumivale::sqlite::Database file(dir.file("server.db"), SQLITE_OPEN_READONLY);
-        auto statement = file.prepare("SELECT sequence, version_id, primary_key, CAST(blob AS TEXT) FROM changes ORDER BY sequence");
-        text += "\nlog:";
-        while (statement.step()) text += " " + std::to_string(statement(0).getInt64()) + "/" + std::to_string(statement(1).getInt64()) + "/" + statement(2).getText() + "=" + statement(3).getText();
+        text += "\nlog (sequence/version/key=blob):";
+        for (const std::string& row : ServerFile(dir.file("server.db")).logRows()) text += " " + row;
         return text;
     }
     // The server's log has no gap, and every change a device was told
@@ -131,7 +140,8 @@ protected:
     void expectLogComplete() {
         ServerFile file(dir.file("server.db"));
         int64_t count = file.single("SELECT COUNT(*) FROM changes WHERE collection = ?", {kCollection});
-        EXPECT_EQ(count, file.single("SELECT IFNULL(MAX(sequence), 0) FROM changes WHERE collection = ?", {kCollection}));
+        EXPECT_EQ(count,
+                  file.single("SELECT IFNULL(MAX(sequence), 0) FROM changes WHERE collection = ?", {kCollection}));
         for (const std::string& tag : tags) {
             std::vector<std::string> persisted = readLines(dir.file(tag + ".state.persisted"));
             EXPECT_FALSE(persisted.empty()) << tag;
@@ -139,8 +149,8 @@ protected:
                 std::istringstream words(line);
                 std::string key, blob;
                 words >> key >> blob;
-                EXPECT_EQ(1, file.single("SELECT COUNT(*) FROM changes WHERE primary_key = ? AND CAST(blob AS TEXT) = ?",
-                                         {key, blob}))
+                const char* sql = "SELECT COUNT(*) FROM changes WHERE primary_key = ? AND CAST(blob AS TEXT) = ?";
+                EXPECT_EQ(1, file.single(sql, {key, blob}))
                     << tag << " was told PERSISTED: " << line;
             }
         }

@@ -16,8 +16,9 @@
 // ("<name>: connection refused: <reason>") and tried again after the back-off.
 //
 // Threads: every operation may be called from any thread, handlers
-// included, except that start() and stop() must not run at the same time. The destructor disconnects and joins the network thread, after
-// which no handler runs; it must not run on that thread.
+// included, except that start() and stop() must not run at the same time.
+// The destructor disconnects and joins the network thread, after which no
+// handler runs; it must not run on that thread.
 //
 // Errors: the constructor throws std::runtime_error when the options cannot be
 // used (a TLS CA file that cannot be read, say); nothing else throws.
