@@ -521,6 +521,7 @@ bool story(const Setup& setup) {
     for (const Device* device : devices) converged = converged && holdsServerNotes(*device);
     std::printf("\n%s\n", converged ? "CONVERGED: every device holds the server's notes, all PERSISTED."
                                     : "NOT CONVERGED: the devices differ (see the table).");
+    std::fflush(stdout);
     for (Device* device : devices) device->quit();
     return converged;
 }
