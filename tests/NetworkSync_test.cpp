@@ -272,6 +272,9 @@ TEST_F(EmbeddedSyncTest, HostilePayloadsOnEveryTopicAreDroppedAndServingGoesOn) 
     unnamed.collectionName = kCollection;
     unnamed.clientId = "";
     ts::SyncProtocol::SubscriptionRequest badSubscription{"\x01", "../etc", "intruder", 0};
+    ts::SyncProtocol::Delta wellFormed = unnamed;
+    wellFormed.clientId = "intruder";
+    ts::SyncProtocol::SubscriptionRequest subscription{"\x01", kCollection, "intruder", 0};
     const std::vector<unsigned char> garbage{0xde, 0xad, 0xbe, 0xef, 0x00, 0x17};
     struct Hostile {
         const char* topic;
@@ -286,6 +289,10 @@ TEST_F(EmbeddedSyncTest, HostilePayloadsOnEveryTopicAreDroppedAndServingGoesOn) 
         {ts::protocol::TOPIC_SUBSCRIBE_COLLECTION, ts::protocol::makePayloadForSubscription(badSubscription)},
         {ts::protocol::TOPIC_SNAPSHOT, garbage},
         {ts::protocol::TOPIC_SNAPSHOT, ts::protocol::makePayloadForSnapshotRequest("", "intruder")},
+        // Well-formed payloads of the wrong kind for their topic.
+        {ts::protocol::TOPIC_CHANGE_RECORD, ts::protocol::makePayloadForSubscription(subscription)},
+        {ts::protocol::TOPIC_SUBSCRIBE_COLLECTION, ts::protocol::makePayloadForSendDelta(wellFormed)},
+        {ts::protocol::TOPIC_SNAPSHOT, ts::protocol::makePayloadForSendDelta(wellFormed)},
     };
     ts::SyncProtocol::Delta oversized = unnamed;
     oversized.clientId = "intruder";
