@@ -22,6 +22,7 @@ packages=(
   libgtest-dev libgmock-dev
   libbenchmark-dev
   libmosquitto-dev mosquitto mosquitto-clients
+  openssl
 )
 foreign_archs=()
 for config in "$@"; do

@@ -254,7 +254,7 @@ protected:
 
     testsupport::LogCapture log;
     TempDir dir;
-    MqttBroker broker{dir, "device", "s3cret"};
+    MqttBroker broker{dir, {"device", "s3cret"}};
     std::unique_ptr<ts::server::NetworkSyncServer> server;
 };
 
@@ -357,6 +357,19 @@ TEST_F(EmbeddedSyncTest, BrokerRequiringCredentialsRefusesAnUnauthenticatedStore
 
     Store member = openStore(brokerOptions("device", "s3cret"), "member");
     EXPECT_TRUE(savePersisted(member, "note"));
+}
+
+TEST_F(EmbeddedSyncTest, TlsBrokerServesStoresThatCheckItsCertificate) {
+    MqttBroker tlsBroker(dir, {"", "", true});
+    tlsBroker.start();
+    ts::mqtt::ConnectionOptions options;
+    options.port = tlsBroker.port;
+    options.caFile = tlsBroker.caFile;
+    options.maxReconnectDelaySeconds = 1;
+    startServer(options);
+
+    Store store = openStore(options, "store");
+    EXPECT_TRUE(savePersisted(store, "note"));
 }
 
 }  // namespace
