@@ -30,8 +30,8 @@
 // changes only after that client's subscription (NetworkSyncServer).
 //
 // Statuses: sendDelta returns 1 when the change went (or, held, goes) to
-// the broker and 0 when it did not (offline); either way the store keeps the change queued
-// until the server's echo. SENT is reported when the broker acknowledges the
+// the broker and 0 when it did not (offline); either way the store keeps the
+// change queued until the server's echo. SENT is reported when the broker acknowledges the
 // publish. PERSISTED never comes from here: the store concludes it from the
 // server's echo of the change, which the server sends only after its commit.
 // (A broker can lose messages it acknowledged when it is killed.)
