@@ -26,6 +26,8 @@ LABELS = {
     "sync_metrics": "sync metrics with 10 000 queued deltas (whole)",
     "scale_save": "save at {size} objects (per save)",
     "scale_range_query": "range query at {size} objects (per row)",
+    "network_latency": "save to callback on another store, via broker + server (floor: in-process server)",
+    "server_throughput": "server, 1000 changes (per change; floor: same rules and file, no broker)",
 }
 ORDER = list(LABELS)
 UNIT_SECONDS = {"ns": 1e-9, "us": 1e-6, "ms": 1e-3, "s": 1.0}

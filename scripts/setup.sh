@@ -21,6 +21,8 @@ packages=(
   libflatbuffers-dev flatbuffers-compiler
   libgtest-dev libgmock-dev
   libbenchmark-dev
+  libmosquitto-dev mosquitto mosquitto-clients
+  openssl
 )
 # The Java API and its checks (plain, asan and clang configurations): the JDK,
 # JUnit and npm for the Kotlin compiler; Debian's host liblog for the Android

@@ -1,9 +1,12 @@
 #include "server/SyncServer.h"
 
+#include <algorithm>
 #include <exception>
+#include <set>
 #include <stdexcept>
 
 #include "platform/Log.h"
+#include "server/MemoryLogStorage.h"
 #include "server/ServerProtocol.h"
 #include "tessarine/Collection.h"
 #include "tessarine/Protocol.h"
@@ -26,6 +29,12 @@ void requireValidCollectionName(const std::string& collectionName) {
 }
 
 }  // namespace
+
+SyncServer::SyncServer() : SyncServer(std::make_unique<MemoryLogStorage>()) {}
+
+SyncServer::SyncServer(std::unique_ptr<LogStorage> storage) : storage(std::move(storage)) {
+    if (!this->storage) throw std::invalid_argument("SyncServer needs a storage");
+}
 
 SyncServer::SessionId SyncServer::attach(Delivery delivery) {
     std::lock_guard<std::mutex> lock(mutex);
@@ -69,71 +78,94 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
     SyncProtocol::Delta change = protocol::makeTessarineDelta(payload, 0);
     requireValidCollectionName(change.collectionName);
     if (change.clientId.empty()) throw std::runtime_error("change without a client id");
-    CollectionLog& log = collection(change.collectionName);
-    CollectionLog::Acceptance acceptance = log.accept(change);
-    if (!acceptance.isNew) {
+    if (std::optional<SyncProtocol::Delta> earlier = storage->findAccepted(change)) {
         // A session that follows the collection has been sent every change
         // up to the last one, so the echo carries that number: a client
         // moves its sequence number forward only, and never asks for (and
         // re-applies) changes it already holds.
         if (session.subscriptions.count(change.collectionName) != 0) {
-            sendChanges(session, {acceptance.change}, log.lastSequenceNumber());
+            sendChanges(session, {*earlier}, storage->lastSequenceNumber(change.collectionName));
         }
-        return receipt(Outcome::CHANGE_ECHOED, change.collectionName, log);
+        return receipt(Outcome::CHANGE_ECHOED, change.collectionName);
     }
+    SyncProtocol::Delta logged = storage->append(change);
     for (const auto& entry : sessions) {
         if (entry.second.subscriptions.count(change.collectionName) != 0) {
-            sendChanges(entry.second, {acceptance.change}, acceptance.change.sequenceNumber);
+            sendChanges(entry.second, {logged}, logged.sequenceNumber);
         }
     }
     lv_printLog(3, kTag, "SyncServer: session %llu: %s/%s version %llu accepted as %llu",
                 static_cast<unsigned long long>(sessionId), change.collectionName.c_str(), change.primaryKey.c_str(),
                 static_cast<unsigned long long>(change.versionId),
-                static_cast<unsigned long long>(acceptance.change.sequenceNumber));
-    return receipt(Outcome::CHANGE_ACCEPTED, change.collectionName, log);
+                static_cast<unsigned long long>(logged.sequenceNumber));
+    return receipt(Outcome::CHANGE_ACCEPTED, change.collectionName);
 }
 
 SyncServer::Receipt SyncServer::receiveSubscription(Session& session, const std::vector<unsigned char>& payload) {
     SyncProtocol::SubscriptionRequest request = parseSubscriptionRequest(payload);
     requireValidCollectionName(request.collectionName);
-    CollectionLog& log = collection(request.collectionName);
+    const std::string& name = request.collectionName;
     // A session that already follows the collection has been sent every
     // change: what the client does not hold yet is on its way. Sending it
     // again would make the client apply older changes over newer ones.
-    if (!session.subscriptions.insert(request.collectionName).second) {
-        return receipt(Outcome::SUBSCRIBED, request.collectionName, log);
-    }
+    if (!session.subscriptions.insert(name).second) return receipt(Outcome::SUBSCRIBED, name);
     // A snapshot never deletes, so it suits only a client that holds nothing
     // of the collection yet besides changes the server never accepted; one
     // whose changes were accepted may hold objects deleted since, and
     // catches up from the start instead.
-    bool holdsNothing = request.sequenceNumber == 0 && !log.hasChangesFrom(request.clientId);
-    bool numberUnknown = request.sequenceNumber > log.lastSequenceNumber();
+    bool holdsNothing = request.sequenceNumber == 0 && !storage->highestVersionId(name, request.clientId);
+    bool numberUnknown = request.sequenceNumber > storage->lastSequenceNumber(name);
     if (holdsNothing || numberUnknown) {
-        session.delivery(makeSnapshotPayload(log.snapshotFor(request.clientId)));
+        session.delivery(makeSnapshotPayload(snapshotFor(name, request.clientId)));
     } else {
-        for (const SyncProtocol::Delta& change : log.catchUpAfter(request.sequenceNumber, request.clientId)) {
+        for (const SyncProtocol::Delta& change : catchUpAfter(name, request.sequenceNumber, request.clientId)) {
             sendChanges(session, {change}, change.sequenceNumber);
         }
     }
-    return receipt(Outcome::SUBSCRIBED, request.collectionName, log);
+    return receipt(Outcome::SUBSCRIBED, name);
 }
 
 SyncServer::Receipt SyncServer::receiveSnapshotRequest(Session& session, const std::vector<unsigned char>& payload) {
     SnapshotRequest request = parseSnapshotRequest(payload);
     requireValidCollectionName(request.collectionName);
-    CollectionLog& log = collection(request.collectionName);
-    session.delivery(makeSnapshotPayload(log.snapshotFor(request.clientId)));
-    return receipt(Outcome::SNAPSHOT_SENT, request.collectionName, log);
+    session.delivery(makeSnapshotPayload(snapshotFor(request.collectionName, request.clientId)));
+    return receipt(Outcome::SNAPSHOT_SENT, request.collectionName);
 }
 
-CollectionLog& SyncServer::collection(const std::string& collectionName) {
-    return collections.try_emplace(collectionName, collectionName).first->second;
+// The changes after sequenceNumber that a client needs to catch up, in
+// order: the last change of each object, and every change of clientId
+// itself. Other clients' changes that a later change of the same object
+// supersedes are left out.
+//
+// Why: a store may ask from a number older than what it has applied (its
+// deliveries were still being applied when it reconnected). It would then
+// apply an older change of another client over its own newer one, which the
+// echo of its own change, already retired, does not restore. Its own changes
+// stay in: until a store sees the echo of a change, it keeps its local
+// version over the changes of others.
+std::vector<SyncProtocol::Delta> SyncServer::catchUpAfter(const std::string& collectionName, uint64_t sequenceNumber,
+                                                          const std::string& clientId) const {
+    std::vector<SyncProtocol::Delta> logged = storage->changesAfter(collectionName, sequenceNumber);
+    std::vector<SyncProtocol::Delta> changes;
+    std::set<std::string> objectsSeen;
+    // Backwards, so that the first change met of an object is its last.
+    for (auto change = logged.rbegin(); change != logged.rend(); ++change) {
+        bool isLastOfObject = objectsSeen.insert(change->primaryKey).second;
+        if (isLastOfObject || change->clientId == clientId) changes.push_back(std::move(*change));
+    }
+    std::reverse(changes.begin(), changes.end());
+    return changes;
 }
 
-const CollectionLog* SyncServer::findCollection(const std::string& collectionName) const {
-    auto found = collections.find(collectionName);
-    return found == collections.end() ? nullptr : &found->second;
+// The current objects with the last sequence number and the client's
+// highest accepted version id.
+SyncProtocol::Snapshot SyncServer::snapshotFor(const std::string& collectionName, const std::string& clientId) const {
+    SyncProtocol::Snapshot snapshot;
+    snapshot.collectionName = collectionName;
+    snapshot.objects = storage->objects(collectionName);
+    snapshot.sequenceNumber = storage->lastSequenceNumber(collectionName);
+    snapshot.versionId = storage->highestVersionId(collectionName, clientId).value_or(0);
+    return snapshot;
 }
 
 void SyncServer::sendChanges(const Session& session, const std::vector<SyncProtocol::Delta>& changes,
@@ -141,26 +173,23 @@ void SyncServer::sendChanges(const Session& session, const std::vector<SyncProto
     session.delivery(makeDeltaListPayload(changes, sequenceNumber));
 }
 
-SyncServer::Receipt SyncServer::receipt(Outcome outcome, const std::string& collectionName, const CollectionLog& log) {
-    return Receipt{outcome, collectionName, log.lastSequenceNumber()};
+SyncServer::Receipt SyncServer::receipt(Outcome outcome, const std::string& collectionName) const {
+    return Receipt{outcome, collectionName, storage->lastSequenceNumber(collectionName)};
 }
 
 uint64_t SyncServer::sequenceNumber(const std::string& collectionName) const {
     std::lock_guard<std::mutex> lock(mutex);
-    const CollectionLog* log = findCollection(collectionName);
-    return log == nullptr ? 0 : log->lastSequenceNumber();
+    return storage->lastSequenceNumber(collectionName);
 }
 
 std::vector<SyncProtocol::TessarineObject> SyncServer::objects(const std::string& collectionName) const {
     std::lock_guard<std::mutex> lock(mutex);
-    const CollectionLog* log = findCollection(collectionName);
-    return log == nullptr ? std::vector<SyncProtocol::TessarineObject>() : log->objects();
+    return storage->objects(collectionName);
 }
 
 uint64_t SyncServer::highestVersionId(const std::string& collectionName, const std::string& clientId) const {
     std::lock_guard<std::mutex> lock(mutex);
-    const CollectionLog* log = findCollection(collectionName);
-    return log == nullptr ? 0 : log->highestVersionId(clientId);
+    return storage->highestVersionId(collectionName, clientId).value_or(0);
 }
 
 }  // namespace server

@@ -1,13 +1,15 @@
-// The reference sync server: an in-memory server that speaks exactly the
-// wire payloads of a store's transport, for demos and for application tests.
-// It owns no socket; a transport (LoopbackTransport, or an application's own)
-// attaches a session for each connection and hands it the bytes that its
-// store publishes, topic by topic.
+// The sync server's rules: speaks exactly the wire payloads of a store's
+// transport, over a LogStorage that keeps what it accepted. With the default
+// MemoryLogStorage it is the reference server, for demos and application
+// tests; the networked server (NetworkSyncServer) runs the same rules over a
+// SqliteLogStorage. It owns no socket; a transport (LoopbackTransport, or an
+// application's own) attaches a session for each connection and hands it the
+// bytes that its store publishes, topic by topic.
 //
 // Rules:
-//   - Per collection the server keeps a log of accepted changes numbered
+//   - Per collection the storage keeps a log of accepted changes numbered
 //     1, 2, 3, ..., the current objects, and per client the highest version
-//     id accepted (CollectionLog).
+//     id accepted.
 //   - A change record (TOPIC_CHANGE_RECORD) is accepted once per (client id,
 //     collection, version id). Every accepted change goes, as a delta list
 //     with its sequence number, to every session subscribed to the
@@ -21,7 +23,7 @@
 //   - A subscription (TOPIC_SUBSCRIBE_COLLECTION) with sequence number n gets
 //     the changes after n, one delta list per change, in order, leaving out
 //     other clients' changes that a later change of the same object
-//     supersedes (CollectionLog::catchUpAfter says why). A snapshot instead
+//     supersedes (catchUpAfter in SyncServer.cpp says why). A snapshot instead
 //     when n = 0 and the server has accepted no change of that client in the
 //     collection (a client that had changes accepted catches up from 0: a
 //     snapshot never deletes, and objects it holds may have been deleted
@@ -39,7 +41,9 @@
 //   - A payload that does not parse, names an invalid collection or an empty
 //     client id, or arrives on an unknown topic is dropped and logged at
 //     priority 5 under the tag "tessarine_server"; it changes nothing and
-//     reaches no one.
+//     reaches no one. So is a change the storage fails to record: nothing is
+//     echoed, and the client sends it again on its next connection.
+//   - A change is sent to anyone only once the storage has recorded it.
 //
 // Threads: every operation may be called from any thread; one mutex guards
 // the whole server. A session's delivery function is called with that mutex
@@ -56,7 +60,9 @@
 #include <string>
 #include <vector>
 
-#include "server/CollectionLog.h"
+#include <memory>
+
+#include "server/LogStorage.h"
 #include "tessarine/SyncProtocol.h"
 
 namespace lumivale {
@@ -85,7 +91,10 @@ public:
         uint64_t sequenceNumber = 0;
     };
 
-    SyncServer() = default;
+    // The reference server, in memory.
+    SyncServer();
+    // A server over the given storage, which it owns.
+    explicit SyncServer(std::unique_ptr<LogStorage> storage);
     SyncServer(const SyncServer&) = delete;
     SyncServer& operator=(const SyncServer&) = delete;
 
@@ -114,16 +123,17 @@ private:
     Receipt receiveChange(SessionId sessionId, Session& session, const std::vector<unsigned char>& payload);
     Receipt receiveSubscription(Session& session, const std::vector<unsigned char>& payload);
     Receipt receiveSnapshotRequest(Session& session, const std::vector<unsigned char>& payload);
-    CollectionLog& collection(const std::string& collectionName);
-    const CollectionLog* findCollection(const std::string& collectionName) const;
+    std::vector<SyncProtocol::Delta> catchUpAfter(const std::string& collectionName, uint64_t sequenceNumber,
+                                                  const std::string& clientId) const;
+    SyncProtocol::Snapshot snapshotFor(const std::string& collectionName, const std::string& clientId) const;
     static void sendChanges(const Session& session, const std::vector<SyncProtocol::Delta>& changes,
                             uint64_t sequenceNumber);
-    static Receipt receipt(Outcome outcome, const std::string& collectionName, const CollectionLog& log);
+    Receipt receipt(Outcome outcome, const std::string& collectionName) const;
 
     mutable std::mutex mutex;
     std::map<SessionId, Session> sessions;
     SessionId lastSessionId = 0;
-    std::map<std::string, CollectionLog> collections;
+    const std::unique_ptr<LogStorage> storage;
 };
 
 }  // namespace server

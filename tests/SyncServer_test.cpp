@@ -4,7 +4,9 @@
 #include <vector>
 
 #include "TestSupport.h"
+#include "server/MemoryLogStorage.h"
 #include "server/ServerProtocol.h"
+#include "server/SqliteLogStorage.h"
 #include "server/SyncServer.h"
 #include "tessarine/Protocol.h"
 
@@ -86,8 +88,25 @@ struct Client {
 
 using Lines = std::vector<std::string>;
 
-TEST(SyncServerTest, ChangeIsAcceptedOncePerClientCollectionAndVersionAndAResendIsEchoedToItsWriterOnly) {
-    SyncServer server;
+// Every rule holds over both storages: in memory (the reference server) and
+// in a SQLite file (the networked server).
+enum class Storage { MEMORY, SQLITE };
+
+class SyncServerTest : public ::testing::TestWithParam<Storage> {
+protected:
+    std::unique_ptr<ts::server::LogStorage> makeStorage() {
+        if (GetParam() == Storage::MEMORY) return std::make_unique<ts::server::MemoryLogStorage>();
+        return std::make_unique<ts::server::SqliteLogStorage>(dir.file("server.db"));
+    }
+
+    testsupport::TempDir dir;
+    SyncServer server{makeStorage()};
+};
+
+INSTANTIATE_TEST_SUITE_P(Storages, SyncServerTest, ::testing::Values(Storage::MEMORY, Storage::SQLITE),
+                         [](const auto& info) { return info.param == Storage::MEMORY ? "Memory" : "Sqlite"; });
+
+TEST_P(SyncServerTest, ChangeIsAcceptedOncePerClientCollectionAndVersionAndAResendIsEchoedToItsWriterOnly) {
     Client writer(server), reader(server), outsider(server);
     writer.subscribe("A", 0);
     reader.subscribe("B", 0);
@@ -130,8 +149,7 @@ TEST(SyncServerTest, ChangeIsAcceptedOncePerClientCollectionAndVersionAndAResend
     EXPECT_EQ(4u, server.highestVersionId("app:notes", "C"));
 }
 
-TEST(SyncServerTest, SubscriptionFromNGetsTheChangesAfterNInOrderAndThenEveryNewChange) {
-    SyncServer server;
+TEST_P(SyncServerTest, SubscriptionFromNGetsTheChangesAfterNInOrderAndThenEveryNewChange) {
     Client writer(server), late(server);
     writer.send(change("A", 1, "k1"));
     writer.send(change("A", 2, "k2", "s", {1, 2}));
@@ -161,8 +179,7 @@ TEST(SyncServerTest, SubscriptionFromNGetsTheChangesAfterNInOrderAndThenEveryNew
     EXPECT_EQ((Lines{"list 6: A/7 k7=1"}), current.take());
 }
 
-TEST(SyncServerTest, SubscriptionFromZeroAndSnapshotRequestsGetSortedSnapshotsWithTheRequestersVersion) {
-    SyncServer server;
+TEST_P(SyncServerTest, SubscriptionFromZeroAndSnapshotRequestsGetSortedSnapshotsWithTheRequestersVersion) {
     Client writer(server);
     writer.send(change("A", 1, "k1", "c"));
     writer.send(change("A", 5, "k2", "a"));
@@ -197,8 +214,7 @@ TEST(SyncServerTest, SubscriptionFromZeroAndSnapshotRequestsGetSortedSnapshotsWi
 // newer content, so it is left out; the client's own changes stay, since
 // they retire its queue in order. A client at 0 whose changes were accepted
 // may hold objects deleted since, which a snapshot would never delete.
-TEST(SyncServerTest, CatchUpLeavesOutOthersSupersededChangesKeepsOwnOnesAndSnapshotsOnlyNewClients) {
-    SyncServer server;
+TEST_P(SyncServerTest, CatchUpLeavesOutOthersSupersededChangesKeepsOwnOnesAndSnapshotsOnlyNewClients) {
     Client writer(server);
     writer.send(change("B", 1, "k1"));
     writer.send(change("A", 1, "k1"));
@@ -218,9 +234,8 @@ TEST(SyncServerTest, CatchUpLeavesOutOthersSupersededChangesKeepsOwnOnesAndSnaps
     EXPECT_EQ((Lines{"snapshot 6 v0: k1@s k3@s"}), fresh.take());
 }
 
-TEST(SyncServerTest, PayloadsThatDoNotParseAreDroppedAndLoggedAndReachNoOne) {
+TEST_P(SyncServerTest, PayloadsThatDoNotParseAreDroppedAndLoggedAndReachNoOne) {
     testsupport::LogCapture log;
-    SyncServer server;
     Client sender(server), subscriber(server);
     subscriber.subscribe("B", 0);
     subscriber.take();
@@ -256,8 +271,7 @@ TEST(SyncServerTest, PayloadsThatDoNotParseAreDroppedAndLoggedAndReachNoOne) {
     EXPECT_EQ((Lines{"list 1: A/1 k=1"}), subscriber.take());
 }
 
-TEST(SyncServerTest, DetachedSessionIsForgottenWithItsSubscriptions) {
-    SyncServer server;
+TEST_P(SyncServerTest, DetachedSessionIsForgottenWithItsSubscriptions) {
     Client writer(server), gone(server);
     gone.subscribe("B", 0);
     gone.take();
@@ -266,6 +280,24 @@ TEST(SyncServerTest, DetachedSessionIsForgottenWithItsSubscriptions) {
     writer.send(change("A", 1, "k"));
     EXPECT_TRUE(gone.take().empty());
     EXPECT_EQ(Outcome::DROPPED, gone.subscribe("B", 0).outcome);
+}
+
+TEST(SqliteLogStorageTest, ReopenedFileServesOnWithItsLogAndRefusesAcceptedChangesAgain) {
+    testsupport::TempDir dir;
+    {
+        SyncServer first(std::make_unique<ts::server::SqliteLogStorage>(dir.file("server.db")));
+        Client writer(first);
+        writer.send(change("A", 1, "k1"));
+        writer.send(change("A", 2, "k2", "s", {7, 0, 8}));
+    }
+    SyncServer reopened(std::make_unique<ts::server::SqliteLogStorage>(dir.file("server.db")));
+    Client writer(reopened);
+    EXPECT_EQ(Outcome::CHANGE_ECHOED, writer.send(change("A", 2, "k2")).outcome);
+    EXPECT_EQ(3u, writer.send(change("B", 1, "k3")).sequenceNumber);
+    Client reader(reopened);
+    reader.subscribe("C", 1);
+    EXPECT_EQ((std::vector<std::string>{"list 2: A/2 k2=3", "list 3: B/1 k3=1"}), reader.take());
+    EXPECT_EQ(2u, reopened.highestVersionId("app:notes", "A"));
 }
 
 }  // namespace

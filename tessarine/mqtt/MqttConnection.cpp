@@ -1,0 +1,196 @@
+#include "tessarine/mqtt/MqttConnection.h"
+
+#include <mosquitto.h>
+
+#include <exception>
+#include <stdexcept>
+
+#include "platform/Log.h"
+
+namespace lumivale {
+namespace tessarine {
+namespace mqtt {
+
+namespace {
+
+constexpr const char* kTag = "tessarine";
+constexpr int kQos = 1;
+
+void initialiseLibrary() {
+    static const int once = mosquitto_lib_init();
+    (void)once;
+}
+
+void require(int rc, const std::string& what) {
+    if (rc != MOSQ_ERR_SUCCESS) throw std::runtime_error(what + ": " + mosquitto_strerror(rc));
+}
+
+}  // namespace
+
+std::string clientTopic(const std::string& clientId) { return "/tessarine_client/" + clientId; }
+
+MqttConnection::MqttConnection(const ConnectionOptions& options, std::string name, Handlers handlers)
+    : settings(options), name(std::move(name)), handlers(std::move(handlers)) {
+    initialiseLibrary();
+    client = createClient();
+}
+
+struct mosquitto* MqttConnection::createClient() {
+    struct mosquitto* created = mosquitto_new(nullptr, true, this);
+    if (created == nullptr) throw std::runtime_error(name + ": cannot create an MQTT client");
+    try {
+        require(mosquitto_int_option(created, MOSQ_OPT_PROTOCOL_VERSION, MQTT_PROTOCOL_V311), "MQTT 3.1.1");
+        // Small messages each waiting for an acknowledgement: without this,
+        // Nagle's algorithm and delayed ACKs add tens of milliseconds to each.
+        require(mosquitto_int_option(created, MOSQ_OPT_TCP_NODELAY, 1), "TCP_NODELAY");
+        if (!settings.username.empty()) {
+            require(mosquitto_username_pw_set(created, settings.username.c_str(),
+                                              settings.password.empty() ? nullptr : settings.password.c_str()),
+                    "credentials");
+        }
+        if (!settings.caFile.empty()) {
+            require(mosquitto_tls_set(created, settings.caFile.c_str(), nullptr, nullptr, nullptr, nullptr),
+                    "TLS CA file " + settings.caFile);
+        }
+        require(mosquitto_reconnect_delay_set(created, settings.minReconnectDelaySeconds,
+                                              settings.maxReconnectDelaySeconds, true),
+                "reconnect delays");
+    } catch (...) {
+        mosquitto_destroy(created);
+        throw;
+    }
+    mosquitto_connect_callback_set(created, &MqttConnection::onConnect);
+    mosquitto_disconnect_callback_set(created, &MqttConnection::onDisconnect);
+    mosquitto_message_callback_set(created, &MqttConnection::onMessage);
+    mosquitto_publish_callback_set(created, &MqttConnection::onPublish);
+    return created;
+}
+
+MqttConnection::~MqttConnection() {
+    stop();
+    if (client != nullptr) mosquitto_destroy(client);
+}
+
+void MqttConnection::start() {
+    if (started) return;
+    if (client == nullptr) {
+        struct mosquitto* created = createClient();
+        std::unique_lock<std::shared_mutex> lock(clientMutex);
+        client = created;
+    }
+    started = true;
+    require(mosquitto_loop_start(client), name + ": cannot start the network thread");
+    // The thread runs first: then a first attempt that fails is retried with
+    // the back-off, as after a lost connection (started the other way round,
+    // the thread gives up at once).
+    int rc = mosquitto_connect_async(client, settings.host.c_str(), settings.port, settings.keepAliveSeconds);
+    if (rc != MOSQ_ERR_SUCCESS) {
+        lv_printLog(4, kTag, "%s: cannot connect to %s:%d yet: %s", name.c_str(), settings.host.c_str(),
+                    settings.port, mosquitto_strerror(rc));
+    }
+}
+
+void MqttConnection::stop() {
+    if (!started) return;
+    // The thread is joined before the client goes, and without the lock:
+    // its handlers may be publishing.
+    mosquitto_disconnect(client);
+    mosquitto_loop_stop(client, false);
+    connected = false;
+    started = false;
+    std::unique_lock<std::shared_mutex> lock(clientMutex);
+    mosquitto_destroy(client);
+    client = nullptr;
+}
+
+void MqttConnection::subscribe(const std::string& topic) {
+    {
+        std::lock_guard<std::mutex> lock(topicsMutex);
+        if (!topics.insert(topic).second) return;
+    }
+    std::shared_lock<std::shared_mutex> lock(clientMutex);
+    if (connected && client != nullptr) mosquitto_subscribe(client, nullptr, topic.c_str(), kQos);
+}
+
+int MqttConnection::publish(const std::string& topic, const std::vector<unsigned char>& payload, bool retain) {
+    std::shared_lock<std::shared_mutex> lock(clientMutex);
+    if (!connected || client == nullptr) return 0;
+    int messageId = 0;
+    int rc = mosquitto_publish(client, &messageId, topic.c_str(), static_cast<int>(payload.size()), payload.data(),
+                               kQos, retain);
+    if (rc != MOSQ_ERR_SUCCESS) {
+        lv_printLog(5, kTag, "%s: cannot publish %zu bytes on \"%s\": %s", name.c_str(), payload.size(),
+                    topic.c_str(), mosquitto_strerror(rc));
+        return 0;
+    }
+    return messageId;
+}
+
+bool MqttConnection::isConnected() const { return connected; }
+
+void MqttConnection::onConnect(struct mosquitto* mosq, void* self, int rc) {
+    static_cast<MqttConnection*>(self)->handleConnect(mosq, rc);
+}
+
+void MqttConnection::onDisconnect(struct mosquitto*, void* self, int rc) {
+    auto* connection = static_cast<MqttConnection*>(self);
+    connection->connected = false;
+    if (rc != 0) lv_printLog(4, kTag, "%s: connection lost: %s", connection->name.c_str(), mosquitto_strerror(rc));
+    if (connection->handlers.disconnected) connection->guard("disconnected", connection->handlers.disconnected);
+}
+
+void MqttConnection::onMessage(struct mosquitto*, void* self, const struct mosquitto_message* message) {
+    static_cast<MqttConnection*>(self)->handleMessage(*message);
+}
+
+void MqttConnection::onPublish(struct mosquitto*, void* self, int messageId) {
+    auto* connection = static_cast<MqttConnection*>(self);
+    if (connection->handlers.published) {
+        connection->guard("published", [&] { connection->handlers.published(messageId); });
+    }
+}
+
+void MqttConnection::handleConnect(struct mosquitto* mosq, int rc) {
+    if (rc != 0) {
+        lv_printLog(5, kTag, "%s: connection refused: %s", name.c_str(), mosquitto_connack_string(rc));
+        return;
+    }
+    // Up first, so that a topic added meanwhile is either in the copy or
+    // subscribed by subscribe() itself.
+    connected = true;
+    std::set<std::string> subscribed;
+    {
+        std::lock_guard<std::mutex> lock(topicsMutex);
+        subscribed = topics;
+    }
+    for (const std::string& topic : subscribed) mosquitto_subscribe(mosq, nullptr, topic.c_str(), kQos);
+    lv_printLog(4, kTag, "%s: connected to %s:%d", name.c_str(), settings.host.c_str(), settings.port);
+    if (handlers.connected) guard("connected", handlers.connected);
+}
+
+void MqttConnection::handleMessage(const struct mosquitto_message& message) {
+    size_t size = static_cast<size_t>(message.payloadlen);
+    if (size > settings.maxPayloadBytes) {
+        lv_printLog(5, kTag, "%s: dropped a payload of %zu bytes on \"%s\": larger than %zu bytes", name.c_str(), size,
+                    message.topic, settings.maxPayloadBytes);
+        return;
+    }
+    if (!handlers.message) return;
+    const auto* bytes = static_cast<const unsigned char*>(message.payload);
+    std::string topic = message.topic;
+    guard("message", [&] { handlers.message(topic, std::vector<unsigned char>(bytes, bytes + size), message.retain); });
+}
+
+void MqttConnection::guard(const char* what, const std::function<void()>& body) {
+    try {
+        body();
+    } catch (const std::exception& e) {
+        lv_printLog(6, kTag, "%s: the %s handler failed: %s", name.c_str(), what, e.what());
+    } catch (...) {
+        lv_printLog(6, kTag, "%s: the %s handler failed", name.c_str(), what);
+    }
+}
+
+}  // namespace mqtt
+}  // namespace tessarine
+}  // namespace lumivale

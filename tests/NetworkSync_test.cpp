@@ -1,0 +1,375 @@
+// Sync across processes through a real broker: stores in processes of their
+// own (tessarine_sync_device) and tessarine-server, or the server and a store
+// embedded here where a test reads their log lines.
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+
+#include <filesystem>
+#include <fstream>
+#include <algorithm>
+#include <mutex>
+#include <map>
+#include <memory>
+#include <set>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "ChildProcess.h"
+#include "MqttBroker.h"
+#include "SyncDevice.h"
+#include "TestSupport.h"
+#include "server/NetworkSyncServer.h"
+#include "server/ServerProtocol.h"
+#include "sqlite/Database.h"
+#include "sqlite/SQLiteException.h"
+#include "tessarine/Protocol.h"
+#include "tessarine/mqtt/MqttTransport.h"
+
+namespace {
+
+namespace ts = lumivale::tessarine;
+using testsupport::ChildProcess;
+using testsupport::MqttBroker;
+using testsupport::TempDir;
+using testsupport::waitUntil;
+
+const char* const kCollection = "net:notes";
+constexpr std::chrono::seconds kConvergeDeadline(30);
+
+std::vector<std::string> readLines(const std::string& path) {
+    std::vector<std::string> lines;
+    std::ifstream in(path);
+    for (std::string line; std::getline(in, line);) lines.push_back(line);
+    return lines;
+}
+
+// A server file read while (or after) tessarine-server writes it.
+class ServerFile {
+public:
+    explicit ServerFile(const std::string& path) : database(path, SQLITE_OPEN_READONLY) {}
+
+    int64_t single(const std::string& sql, const std::vector<std::string>& texts = {}) {
+        auto statement = database.prepare(sql);
+        for (size_t i = 0; i < texts.size(); ++i) statement.bind(static_cast<int>(i + 1), texts[i]);
+        statement.step();
+        return statement(0).getInt64();
+    }
+    // The objects as testsupport::objectRows gives a store's, all PERSISTED.
+    std::vector<std::string> objectRows() {
+        auto statement = database.prepare(
+            "SELECT primary_key, sort_key, blob FROM objects WHERE collection = ? ORDER BY sort_key, primary_key");
+        statement.bind(1, std::string(kCollection));
+        std::vector<std::string> rows;
+        while (statement.step()) {
+            auto blob = statement(2).getBlobDirectBuffer();
+            rows.push_back(statement(0).getText() + "@" + statement(1).getText() + "=" +
+                           testsupport::hex(blob.first, blob.second) + "#3");
+        }
+        return rows;
+    }
+
+    std::vector<std::string> logRows() {
+        auto statement = database.prepare(
+            "SELECT sequence, version_id, primary_key, CAST(blob AS TEXT) FROM changes ORDER BY sequence");
+        std::vector<std::string> rows;
+        while (statement.step()) {
+            rows.push_back(std::to_string(statement(0).getInt64()) + "/" + std::to_string(statement(1).getInt64()) +
+                           "/" + statement(2).getText() + "=" + statement(3).getText());
+        }
+        return rows;
+    }
+
+private:
+    lumivale::sqlite::Database database;
+};
+
+class NetworkSyncTest : public ::testing::Test {
+protected:
+    std::unique_ptr<ChildProcess> startServer() {
+        return std::make_unique<ChildProcess>(TESSARINE_SERVER_PROGRAM,
+                                              std::vector<std::string>{"--broker-port", std::to_string(broker.port),
+                                                                       "--data", dir.file("server.db")},
+                                              TESSARINE_TEST_EMULATOR);
+    }
+    void startDevice(const std::string& tag, int writes, int pauseMs) {
+        devices.push_back(std::make_unique<ChildProcess>(
+            TESSARINE_SYNC_DEVICE,
+            std::vector<std::string>{dir.file(tag + ".db"), std::to_string(broker.port), tag, std::to_string(writes),
+                                     std::to_string(pauseMs), dir.file(tag + ".state")},
+            TESSARINE_TEST_EMULATOR));
+        tags.push_back(tag);
+    }
+    std::vector<std::string> deviceRows(const std::string& tag) { return readLines(dir.file(tag + ".state")); }
+    // 0 also while the server has not made its file yet.
+    int64_t changesLogged() {
+        try {
+            if (!std::filesystem::exists(dir.file("server.db"))) return 0;
+            return ServerFile(dir.file("server.db")).single("SELECT COUNT(*) FROM changes");
+        } catch (const lumivale::sqlite::SQLiteException&) {
+            return 0;
+        }
+    }
+    // Every device done writing and holding exactly the server's objects,
+    // all PERSISTED.
+    bool converged() {
+        if (changesLogged() == 0) return false;
+        std::vector<std::string> expected = ServerFile(dir.file("server.db")).objectRows();
+        expected.insert(expected.begin(), "done");
+        for (const std::string& tag : tags) {
+            if (deviceRows(tag) != expected) return false;
+        }
+        return true;
+    }
+    // What each device and the server hold, for failure messages.
+    std::string describe() {
+        std::string text;
+        for (const std::string& tag : tags) {
+            text += "device " + tag + ":";
+            for (const std::string& row : deviceRows(tag)) text += " " + row;
+            text += "\n";
+        }
+        text += "server:";
+        for (const std::string& row : ServerFile(dir.file("server.db")).objectRows()) text += " " + row;
+        text += "\nlog (sequence/version/key=blob):";
+        for (const std::string& row : ServerFile(dir.file("server.db")).logRows()) text += " " + row;
+        return text;
+    }
+    // The server's log has no gap, and every change a device was told
+    // PERSISTED is in it exactly once.
+    void expectLogComplete() {
+        ServerFile file(dir.file("server.db"));
+        int64_t count = file.single("SELECT COUNT(*) FROM changes WHERE collection = ?", {kCollection});
+        EXPECT_EQ(count,
+                  file.single("SELECT IFNULL(MAX(sequence), 0) FROM changes WHERE collection = ?", {kCollection}));
+        for (const std::string& tag : tags) {
+            std::vector<std::string> persisted = readLines(dir.file(tag + ".state.persisted"));
+            EXPECT_FALSE(persisted.empty()) << tag;
+            for (const std::string& line : persisted) {
+                std::istringstream words(line);
+                std::string key, blob;
+                words >> key >> blob;
+                const char* sql = "SELECT COUNT(*) FROM changes WHERE primary_key = ? AND CAST(blob AS TEXT) = ?";
+                EXPECT_EQ(1, file.single(sql, {key, blob}))
+                    << tag << " was told PERSISTED: " << line;
+            }
+        }
+    }
+    void stopDevices() {
+        for (auto& device : devices) device->kill(SIGTERM);
+        for (auto& device : devices) {
+            int status = device->wait();
+            EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << testsupport::describeWaitStatus(status);
+        }
+    }
+
+    TempDir dir;
+    MqttBroker broker{dir};
+    std::vector<std::unique_ptr<ChildProcess>> devices;
+    std::vector<std::string> tags;
+};
+
+TEST_F(NetworkSyncTest, OfflineWritesOfTwoStoresAreDeliveredAndConvergeOnceBrokerAndServerAreUp) {
+    startDevice("a", 12, 0);
+    startDevice("b", 12, 0);
+    // Without a broker every change stays PENDING (status 1).
+    auto allPending = [&](const std::string& tag) {
+        std::vector<std::string> rows = deviceRows(tag);
+        if (rows.empty()) return false;
+        for (size_t i = 1; i < rows.size(); ++i) {
+            if (rows[i].substr(rows[i].size() - 2) != "#1") return false;
+        }
+        return true;
+    };
+    ASSERT_TRUE(waitUntil([&] { return allPending("a") && allPending("b"); }));
+
+    broker.start();
+    auto server = startServer();
+    ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
+    expectLogComplete();
+    stopDevices();
+    server->kill(SIGTERM);
+    EXPECT_EQ(0, server->wait());
+}
+
+TEST_F(NetworkSyncTest, ThreeStoresConvergeThroughServerKilledMidStreamAndBrokerRestarted) {
+    broker.start();
+    auto server = startServer();
+    for (const char* tag : {"a", "b", "c"}) startDevice(tag, 40, 25);
+
+    ASSERT_TRUE(waitUntil([&] { return changesLogged() >= 10; }));
+    server->kill(SIGKILL);
+    server->wait();
+    server = startServer();
+
+    int64_t beforeBrokerCrash = changesLogged();
+    ASSERT_TRUE(waitUntil([&] { return changesLogged() >= beforeBrokerCrash + 10; }));
+    broker.kill();
+    broker.start();
+
+    ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
+    expectLogComplete();
+    stopDevices();
+}
+
+// A store and the server embedded in this process, so that their log lines
+// can be read.
+class EmbeddedSyncTest : public ::testing::Test {
+protected:
+    ts::mqtt::ConnectionOptions brokerOptions(const std::string& user = "", const std::string& password = "") {
+        ts::mqtt::ConnectionOptions options;
+        options.port = broker.port;
+        options.maxReconnectDelaySeconds = 1;
+        options.username = user;
+        options.password = password;
+        return options;
+    }
+    void startServer(const ts::mqtt::ConnectionOptions& options) {
+        server = std::make_unique<ts::server::NetworkSyncServer>(
+            ts::server::NetworkSyncServer::Options{options, dir.file("server.db")});
+        server->start();
+    }
+    struct Store {
+        std::shared_ptr<ts::mqtt::MqttTransport> transport;
+        std::unique_ptr<ts::Tessarine> store;
+        std::unique_ptr<ts::Collection> notes;
+    };
+    Store openStore(const ts::mqtt::ConnectionOptions& options, const std::string& name) {
+        Store opened;
+        opened.transport = std::make_shared<ts::mqtt::MqttTransport>(options);
+        opened.store = ts::Tessarine::open(dir.file(name + ".db"), opened.transport,
+                                           std::make_shared<testsupport::CountingThreadCreator>());
+        opened.store->start();
+        opened.notes = opened.store->subscribeCollection(kCollection);
+        return opened;
+    }
+    // Saves a note and waits until the server's echo made it PERSISTED.
+    static bool savePersisted(Store& store, const std::string& key) {
+        store.notes->saveObject(key, key, {1, 2, 3});
+        return waitUntil([&] {
+            std::vector<std::string> rows = testsupport::objectRows(*store.notes);
+            return std::count(rows.begin(), rows.end(), key + "@" + key + "=010203#3") == 1;
+        });
+    }
+
+    testsupport::LogCapture log;
+    TempDir dir;
+    MqttBroker broker{dir, {"device", "s3cret"}};
+    std::unique_ptr<ts::server::NetworkSyncServer> server;
+};
+
+TEST_F(EmbeddedSyncTest, HostilePayloadsOnEveryTopicAreDroppedAndServingGoesOn) {
+    broker.start();
+    ts::mqtt::ConnectionOptions options = brokerOptions("device", "s3cret");
+    options.maxPayloadBytes = 4096;
+    startServer(options);
+
+    ts::SyncProtocol::Delta change;
+    change.clientId = "intruder";
+    change.collectionName = "not a valid name!";
+    change.primaryKey = "k";
+    ts::SyncProtocol::Delta unnamed = change;
+    unnamed.collectionName = kCollection;
+    unnamed.clientId = "";
+    ts::SyncProtocol::SubscriptionRequest badSubscription{"\x01", "../etc", "intruder", 0};
+    ts::SyncProtocol::Delta wellFormed = unnamed;
+    wellFormed.clientId = "intruder";
+    ts::SyncProtocol::SubscriptionRequest subscription{"\x01", kCollection, "intruder", 0};
+    const std::vector<unsigned char> garbage{0xde, 0xad, 0xbe, 0xef, 0x00, 0x17};
+    struct Hostile {
+        const char* topic;
+        std::vector<unsigned char> payload;
+    };
+    const std::vector<Hostile> droppedByRules = {
+        {ts::protocol::TOPIC_CHANGE_RECORD, garbage},
+        {ts::protocol::TOPIC_CHANGE_RECORD, {}},
+        {ts::protocol::TOPIC_CHANGE_RECORD, ts::protocol::makePayloadForSendDelta(change)},
+        {ts::protocol::TOPIC_CHANGE_RECORD, ts::protocol::makePayloadForSendDelta(unnamed)},
+        {ts::protocol::TOPIC_SUBSCRIBE_COLLECTION, garbage},
+        {ts::protocol::TOPIC_SUBSCRIBE_COLLECTION, ts::protocol::makePayloadForSubscription(badSubscription)},
+        {ts::protocol::TOPIC_SNAPSHOT, garbage},
+        {ts::protocol::TOPIC_SNAPSHOT, ts::protocol::makePayloadForSnapshotRequest("", "intruder")},
+        // Well-formed payloads of the wrong kind for their topic.
+        {ts::protocol::TOPIC_CHANGE_RECORD, ts::protocol::makePayloadForSubscription(subscription)},
+        {ts::protocol::TOPIC_SUBSCRIBE_COLLECTION, ts::protocol::makePayloadForSendDelta(wellFormed)},
+        {ts::protocol::TOPIC_SNAPSHOT, ts::protocol::makePayloadForSendDelta(wellFormed)},
+    };
+    ts::SyncProtocol::Delta oversized = unnamed;
+    oversized.clientId = "intruder";
+    oversized.blob.assign(8192, 'x');
+
+    // The intruder waits for the server to be online, and listens to every
+    // client's topic to learn a store's.
+    std::mutex mutex;
+    bool serverOnline = false;
+    std::string storeTopic;
+    ts::mqtt::MqttConnection intruder(options, "intruder",
+                                      {nullptr,
+                                       [&](const std::string& topic, std::vector<unsigned char>, bool) {
+                                           std::lock_guard<std::mutex> lock(mutex);
+                                           if (topic == ts::mqtt::TOPIC_SERVER_ONLINE) {
+                                               serverOnline = true;
+                                           } else {
+                                               storeTopic = topic;
+                                           }
+                                       },
+                                       nullptr, nullptr});
+    intruder.subscribe(ts::mqtt::TOPIC_SERVER_ONLINE);
+    intruder.subscribe(ts::mqtt::clientTopic("#"));
+    intruder.start();
+    ASSERT_TRUE(waitUntil([&] {
+        std::lock_guard<std::mutex> lock(mutex);
+        return serverOnline && intruder.isConnected();
+    }));
+    for (const Hostile& hostile : droppedByRules) ASSERT_GT(intruder.publish(hostile.topic, hostile.payload), 0);
+    ASSERT_GT(intruder.publish(ts::protocol::TOPIC_CHANGE_RECORD, ts::protocol::makePayloadForSendDelta(oversized)), 0);
+
+    EXPECT_TRUE(waitUntil([&] {
+        return log.linesStartingWith("SyncServer: dropped a payload").size() == droppedByRules.size() &&
+               log.linesStartingWith("tessarine-server: dropped a payload of").size() == 1;
+    })) << log.linesStartingWith("SyncServer: dropped a payload").size();
+
+    // A store still syncs, and takes no harm from garbage on its own topic.
+    Store store = openStore(options, "store");
+    ASSERT_TRUE(savePersisted(store, "first"));
+    std::string topic;
+    ASSERT_TRUE(waitUntil([&] {
+        std::lock_guard<std::mutex> lock(mutex);
+        topic = storeTopic;
+        return !topic.empty();
+    }));
+    ASSERT_GT(intruder.publish(topic, garbage), 0);
+    EXPECT_TRUE(waitUntil([&] { return !log.linesStartingWith("MqttTransport: dropped a server payload").empty(); }));
+    ASSERT_TRUE(savePersisted(store, "second"));
+    EXPECT_EQ(2u, server->rules().sequenceNumber(kCollection));
+    EXPECT_EQ(2u, server->rules().objects(kCollection).size());
+    EXPECT_EQ(0u, server->rules().sequenceNumber("not a valid name!"));
+}
+
+TEST_F(EmbeddedSyncTest, BrokerRequiringCredentialsRefusesAnUnauthenticatedStore) {
+    broker.start();
+    startServer(brokerOptions("device", "s3cret"));
+
+    ts::mqtt::MqttTransport stranger(brokerOptions("device", "wrong"));
+    stranger.start();
+    EXPECT_TRUE(waitUntil([&] { return !log.linesStartingWith("MqttTransport: connection refused").empty(); }));
+    EXPECT_FALSE(stranger.isConnected());
+
+    Store member = openStore(brokerOptions("device", "s3cret"), "member");
+    EXPECT_TRUE(savePersisted(member, "note"));
+}
+
+TEST_F(EmbeddedSyncTest, TlsBrokerServesStoresThatCheckItsCertificate) {
+    MqttBroker tlsBroker(dir, {"", "", true});
+    tlsBroker.start();
+    ts::mqtt::ConnectionOptions options;
+    options.port = tlsBroker.port;
+    options.caFile = tlsBroker.caFile;
+    options.maxReconnectDelaySeconds = 1;
+    startServer(options);
+
+    Store store = openStore(options, "store");
+    EXPECT_TRUE(savePersisted(store, "note"));
+}
+
+}  // namespace
