@@ -15,6 +15,12 @@ using Lock = std::lock_guard<ConnectionMutex>;
 Statement::Statement(std::shared_ptr<Connection> connection, sqlite3_stmt* statement)
     : connection(std::move(connection)), statement(statement) {}
 
+Statement::ScopedLock::ScopedLock(const Statement& statement) : connection(*statement.connection) {
+    connection.mutex().lock();
+}
+
+Statement::ScopedLock::~ScopedLock() { connection.mutex().unlock(); }
+
 Statement::Statement(Statement&& other) noexcept
     : connection(std::move(other.connection)), statement(other.statement), finished(other.finished) {
     other.statement = nullptr;
@@ -150,6 +156,14 @@ void Statement::Column::copyTextTo(std::string& target) const {
     } else {
         target.assign(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(s, index)));
     }
+}
+
+std::string_view Statement::Column::getTextView() const {
+    sqlite3_stmt* s = statement.checkedHandle("reading a column");
+    Lock lock(statement.connection->mutex());
+    const unsigned char* text = sqlite3_column_text(s, index);
+    if (text == nullptr) return std::string_view();
+    return std::string_view(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(s, index)));
 }
 
 std::pair<const unsigned char*, std::size_t> Statement::Column::getBlobDirectBuffer() const {

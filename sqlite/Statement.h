@@ -18,6 +18,7 @@
 #include <cstddef>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <utility>
 
 struct sqlite3_stmt;
@@ -37,6 +38,9 @@ public:
         std::string getText() const;  // empty for NULL; may hold zero bytes
         // Copies the text into target, reusing its storage.
         void copyTextTo(std::string& target) const;
+        // The text in place, valid until the statement is stepped, reset or
+        // destroyed; empty for NULL.
+        std::string_view getTextView() const;
         // The bytes in place, valid until the statement is stepped, reset or
         // destroyed. NULL and zero-length values give a count of 0.
         std::pair<const unsigned char*, std::size_t> getBlobDirectBuffer() const;
@@ -46,6 +50,20 @@ public:
         Column(const Statement& statement, int index) : statement(statement), index(index) {}
         const Statement& statement;
         int index;
+    };
+
+    // Keeps other threads off the statement's connection while it lives, so
+    // that stepping and reading a row's columns takes the lock once; as
+    // Database::ScopedLock. The statement must outlive it.
+    class ScopedLock {
+    public:
+        explicit ScopedLock(const Statement& statement);
+        ~ScopedLock();
+        ScopedLock(const ScopedLock&) = delete;
+        ScopedLock& operator=(const ScopedLock&) = delete;
+
+    private:
+        Connection& connection;
     };
 
     Statement(Statement&& other) noexcept;

@@ -13,26 +13,25 @@ std::string CreateCollectionTable::getSql(const std::string& tableName) {
 }
 
 std::string QueryCollection::getSql(const std::string& tableName, bool ascending) {
-    return "SELECT primary_key, sort_key, blob, status FROM " + quoted(tableName) + " " + "WHERE sort_key " +
-           (ascending ? ">=" : "<=") + " ? " + "ORDER BY sort_key " + (ascending ? "ASC" : "DESC") + " " +
-           "LIMIT ?";
+    return concat({"SELECT primary_key, sort_key, blob, status FROM \"", tableName, "\" WHERE sort_key ",
+                   ascending ? ">=" : "<=", " ? ORDER BY sort_key ", ascending ? "ASC" : "DESC", " LIMIT ?"});
 }
 
 std::string GetObject::getSql(const std::string& tableName) {
-    return "SELECT primary_key, sort_key, blob, status FROM " + quoted(tableName) + " " + "WHERE primary_key = ?";
+    return concat({"SELECT primary_key, sort_key, blob, status FROM \"", tableName, "\" WHERE primary_key = ?"});
 }
 
 std::string SaveObject::getSql(const std::string& tableName) {
-    return "INSERT OR REPLACE INTO " + quoted(tableName) + " " + "(primary_key, sort_key, blob, status) " +
-           "VALUES (?, ?, ?, ?)";
+    return concat({"INSERT OR REPLACE INTO \"", tableName,
+                   "\" (primary_key, sort_key, blob, status) VALUES (?, ?, ?, ?)"});
 }
 
 std::string DeleteObject::getSql(const std::string& tableName) {
-    return "DELETE FROM " + quoted(tableName) + " " + "WHERE primary_key = ?";
+    return concat({"DELETE FROM \"", tableName, "\" WHERE primary_key = ?"});
 }
 
 std::string UpdateObjectStatus::getSql(const std::string& tableName) {
-    return "UPDATE " + quoted(tableName) + " " + "SET status = ? WHERE primary_key = ?";
+    return concat({"UPDATE \"", tableName, "\" SET status = ? WHERE primary_key = ?"});
 }
 
 }  // namespace dbqueries

@@ -1,8 +1,9 @@
 #include "tessarine/Cursor.h"
 
+#include <exception>
+
 #include "platform/Assert.h"
 #include "platform/Log.h"
-#include "sqlite/SQLiteException.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -18,12 +19,21 @@ Cursor::Cursor(lumivale::sqlite::Statement&& statement, int primaryKeyColumn, in
 bool Cursor::step() noexcept {
     if (!statement) return false;
     try {
+        lumivale::sqlite::Statement::ScopedLock lock(*statement);
         hasCurrentRow = statement->step();
-    } catch (const lumivale::sqlite::SQLiteException& e) {
+        if (hasCurrentRow) readRow();
+    } catch (const std::exception& e) {
         hasCurrentRow = false;
         lv_printLog(5, "tessarine", "Cursor::step failed: %s", e.what());
     }
     return hasCurrentRow;
+}
+
+void Cursor::readRow() {
+    primaryKey = (*statement)(primaryKeyColumn).getTextView();
+    sortKey = (*statement)(sortKeyColumn).getTextView();
+    blob = (*statement)(blobColumn).getBlobDirectBuffer();
+    status = (*statement)(statusColumn).getInt();
 }
 
 void Cursor::close() noexcept {
@@ -40,22 +50,22 @@ void Cursor::checkCurrentRow() const noexcept {
 
 std::string Cursor::getPrimaryKey() const noexcept {
     checkCurrentRow();
-    return (*statement)(primaryKeyColumn).getText();
+    return std::string(primaryKey);
 }
 
 std::string Cursor::getSortKey() const noexcept {
     checkCurrentRow();
-    return (*statement)(sortKeyColumn).getText();
+    return std::string(sortKey);
 }
 
 std::pair<const unsigned char*, std::size_t> Cursor::getBlob() const noexcept {
     checkCurrentRow();
-    return (*statement)(blobColumn).getBlobDirectBuffer();
+    return blob;
 }
 
 int Cursor::getStatus() const noexcept {
     checkCurrentRow();
-    return (*statement)(statusColumn).getInt();
+    return status;
 }
 
 }  // namespace tessarine

@@ -22,6 +22,7 @@
 #include <cstddef>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <utility>
 
 #include "sqlite/Statement.h"
@@ -51,11 +52,20 @@ public:
 
 private:
     void checkCurrentRow() const noexcept;
+    // Reads the current row's columns; the connection's lock is held.
+    void readRow();
 
     // Held in place rather than on the heap, so that the constructor cannot
     // fail; empty once the cursor is closed.
     std::optional<lumivale::sqlite::Statement> statement;
     bool hasCurrentRow = false;
+    // The current row, read under the same lock as the step that found it,
+    // so that the getters take no lock. Texts and blob point into the
+    // statement and stay valid until the next step.
+    std::string_view primaryKey;
+    std::string_view sortKey;
+    std::pair<const unsigned char*, std::size_t> blob{nullptr, 0};
+    int status = 0;
     int primaryKeyColumn;
     int sortKeyColumn;
     int blobColumn;

@@ -8,7 +8,16 @@ namespace tessarine {
 
 namespace dbqueries {
 
-std::string quoted(const std::string& name) { return "\"" + name + "\""; }
+std::string quoted(const std::string& name) { return concat({"\"", name, "\""}); }
+
+std::string concat(std::initializer_list<std::string_view> parts) {
+    size_t size = 0;
+    for (std::string_view part : parts) size += part.size();
+    std::string result;
+    result.reserve(size);
+    for (std::string_view part : parts) result.append(part);
+    return result;
+}
 
 }  // namespace dbqueries
 

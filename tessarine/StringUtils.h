@@ -1,12 +1,15 @@
 // Small string helpers shared by the storage classes.
 //
-// dbqueries::quoted writes a table name into SQL; stringReplace fills the
+// dbqueries::quoted writes a table name into SQL, dbqueries::concat joins
+// the pieces of a statement's text; stringReplace fills the
 // place-holders of caller-supplied SQL; stringToLongLong reads numbers kept
 // as text. All are pure functions: safe from any thread, and they throw
 // nothing but std::bad_alloc.
 #pragma once
 
+#include <initializer_list>
 #include <string>
+#include <string_view>
 
 namespace lumivale {
 namespace tessarine {
@@ -17,6 +20,10 @@ namespace dbqueries {
 // doubled. Only names made of letters, digits, underscores and colons (the
 // per-collection table names) are meant to go through it.
 std::string quoted(const std::string& name);
+
+// The parts one after another, built with a single allocation: SQL texts are
+// made on every operation, so their building should cost next to nothing.
+std::string concat(std::initializer_list<std::string_view> parts);
 
 }  // namespace dbqueries
 
