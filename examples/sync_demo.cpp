@@ -92,11 +92,6 @@ private:
     const std::chrono::steady_clock::time_point start = std::chrono::steady_clock::now();
 };
 
-class PlainThreadCreator : public ThreadCreator {
-public:
-    std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
-};
-
 struct Note {
     std::string key;
     std::string text;
@@ -197,7 +192,7 @@ private:
     uint64_t seed;
     std::shared_ptr<SyncServer> server;
     Timeline& timeline;
-    std::shared_ptr<PlainThreadCreator> threadCreator = std::make_shared<PlainThreadCreator>();
+    std::shared_ptr<StdThreadCreator> threadCreator = std::make_shared<StdThreadCreator>();
     std::shared_ptr<LoopbackTransport> transport;
     std::unique_ptr<ts::Tessarine> store;
     std::unique_ptr<ts::Collection> notes;
