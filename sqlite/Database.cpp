@@ -10,6 +10,11 @@
 namespace lumivale {
 namespace sqlite {
 
+static_assert(kOpenReadOnly == SQLITE_OPEN_READONLY && kOpenReadWrite == SQLITE_OPEN_READWRITE &&
+                  kOpenCreate == SQLITE_OPEN_CREATE,
+              "the named open flags are sqlite3.h's");
+static_assert(kErrorReadOnly == SQLITE_READONLY, "the named result code is sqlite3.h's");
+
 namespace {
 
 const char* beginSql(Database::TransactionType type) {

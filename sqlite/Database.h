@@ -28,6 +28,12 @@ namespace sqlite {
 
 class Connection;
 
+// sqlite3_open_v2's flags, named for code that does not include sqlite3.h.
+constexpr int kOpenReadOnly = 0x1;
+constexpr int kOpenReadWrite = 0x2;
+constexpr int kOpenCreate = 0x4;
+constexpr int kOpenReadWriteCreate = kOpenReadWrite | kOpenCreate;
+
 class Database {
 public:
     // How a transaction takes its locks. The store always uses Immediate (2):
@@ -56,7 +62,7 @@ public:
         std::shared_ptr<Connection> connection;
     };
 
-    // flags are sqlite3_open_v2's (the store passes read-write | create).
+    // flags are sqlite3_open_v2's (the store passes kOpenReadWriteCreate).
     // "" and ":memory:" keep SQLite's meaning.
     Database(const std::string& path, int flags);
     ~Database();

@@ -66,6 +66,8 @@ void Statement::bind(int index, long long value) {
     if (rc != SQLITE_OK) fail(rc, "binding");
 }
 
+void Statement::bind(int index, uint64_t value) { bind(index, static_cast<long long>(value)); }
+
 void Statement::bind(int index, const std::string& value) { bindText(index, value, SQLITE_TRANSIENT); }
 
 void Statement::bindWithoutCopy(int index, const std::string& value) { bindText(index, value, SQLITE_STATIC); }
@@ -132,6 +134,8 @@ long long Statement::Column::getInt64() const {
     Lock lock(statement.connection->mutex());
     return sqlite3_column_int64(s, index);
 }
+
+uint64_t Statement::Column::getUint64() const { return static_cast<uint64_t>(getInt64()); }
 
 std::string Statement::Column::getText() const {
     sqlite3_stmt* s = statement.checkedHandle("reading a column");

@@ -21,7 +21,7 @@ bool Cursor::step() noexcept {
         hasCurrentRow = statement->step();
     } catch (const lumivale::sqlite::SQLiteException& e) {
         hasCurrentRow = false;
-        lv_printLog(5, "tessarine", "Cursor::step failed: %s", e.what());
+        lv_printLog(lumivale::LogPriority::kWarn, "tessarine", "Cursor::step failed: %s", e.what());
     }
     return hasCurrentRow;
 }
@@ -33,8 +33,7 @@ void Cursor::close() noexcept {
 
 void Cursor::checkCurrentRow() const noexcept {
     if (!hasCurrentRow) {
-        lumivale::assertInternal("Assert (%s:%d): There's no current row. Did you forget to call step()?", "Cursor",
-                                 __LINE__);
+        LV_ASSERT_FAIL("Cursor", "There's no current row. Did you forget to call step()?");
     }
 }
 

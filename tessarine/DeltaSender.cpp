@@ -129,7 +129,7 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
         deltaQueueStorage->readDeltasInIdRange(afterId, upToId, kResendChunkSize, chunk.rows);
         for (auto& row : chunk.rows) row.delta.clientId = clientId;
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", kResendError, e.what());
+        lv_printLog(lumivale::LogPriority::kError, "tessarine", kResendError, e.what());
         failed = true;
     }
     std::optional<unsigned> completedCount;
@@ -147,7 +147,7 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
         }
     }
     if (completedCount) {
-        lv_printLog(3, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)", *completedCount);
+        lv_printLog(lumivale::LogPriority::kDebug, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)", *completedCount);
     }
 }
 

@@ -30,7 +30,7 @@ void JobRetryMonitor::attemptFailed(const std::string& error) {
         stallReported = true;
         failedFor = millisecondsSince(failingSinceSteady);
     }
-    lv_printLog(6, "tessarine", "Store stalled: a job has been failing for %lld ms: %s", failedFor, error.c_str());
+    lv_printLog(lumivale::LogPriority::kError, "tessarine", "Store stalled: a job has been failing for %lld ms: %s", failedFor, error.c_str());
 }
 
 void JobRetryMonitor::jobEnded(bool succeeded) {
@@ -44,7 +44,7 @@ void JobRetryMonitor::jobEnded(bool succeeded) {
         stallReported = false;
     }
     if (reportRecovery) {
-        lv_printLog(4, "tessarine", "Store recovered: a job succeeded after failing for %lld ms", failedFor);
+        lv_printLog(lumivale::LogPriority::kInfo, "tessarine", "Store recovered: a job succeeded after failing for %lld ms", failedFor);
     }
 }
 

@@ -120,7 +120,7 @@ std::optional<std::string> SerializedJobQueue::attempt(const Job& job) {
     } catch (const std::exception& e) {
         return std::string(e.what());  // the job has logged what went wrong
     } catch (...) {
-        lv_printLog(6, "tessarine", "Job failed with an exception not derived from std::exception; retrying");
+        lv_printLog(lumivale::LogPriority::kError, "tessarine", "Job failed with an exception not derived from std::exception; retrying");
         return std::string("an exception not derived from std::exception");
     }
 }

@@ -41,7 +41,7 @@ void SnapshotConsumer::onSnapshotReceived(const SyncProtocol::Snapshot& snapshot
         }
         syncProtocol->triggerDeltaReceivedCallbacks(deltas);
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", "Error while processing snapshot: %s", e.what());
+        lv_printLog(lumivale::LogPriority::kError, "tessarine", "Error while processing snapshot: %s", e.what());
         throw;
     }
 }

@@ -51,7 +51,7 @@ uint64_t SubscriptionManager::getSequenceNumber(const std::string& collectionNam
 }
 
 void SubscriptionManager::onConnectionEstablished() {
-    lv_printLog(3, "tessarine", "SubscriptionManager::onConnectionEstablished is called back");
+    lv_printLog(lumivale::LogPriority::kDebug, "tessarine", "SubscriptionManager::onConnectionEstablished is called back");
     try {
         for (const Subscription& subscription : subscriptionStorage->getSubscriptions()) {
             sendSubscribeCollectionRequest(subscription.collectionName, subscription.sequenceNumber);

@@ -25,7 +25,7 @@ void VersionVectorStorage::updateCollectionVersionVector(const std::string& coll
                                        " (collection_name, client_id, version_id) VALUES (?, ?, ?)");
     statement.bind(1, collectionName);
     statement.bind(2, clientId);
-    statement.bind(3, static_cast<long long>(versionId));
+    statement.bind(3, versionId);
     statement.step();
 }
 
@@ -34,7 +34,7 @@ uint64_t VersionVectorStorage::getCollectionVersion(const std::string& collectio
                                        " WHERE collection_name = ? AND client_id = ?");
     statement.bind(1, collectionName);
     statement.bind(2, clientId);
-    return statement.step() ? static_cast<uint64_t>(statement(0).getInt64()) : 0;
+    return statement.step() ? statement(0).getUint64() : 0;
 }
 
 }  // namespace tessarine

@@ -31,7 +31,7 @@ protected:
     }
 
     testsupport::TempDir dir;
-    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("cursor.db"), 6);
+    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("cursor.db"), lumivale::sqlite::kOpenReadWriteCreate);
 };
 
 TEST_F(CursorTest, ReadsFieldsFromTheirColumnsRepeatedlyAndKeepsReportingTheEndOrAnError) {

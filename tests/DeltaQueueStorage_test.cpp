@@ -132,7 +132,7 @@ TEST_F(DeltaQueueStorageTest, SchemaAndIndexNamesAreExact) {
 }
 
 TEST(DeltaQueueStorageDeathTest, StoringPersistedIsABrokenInvariant) {
-    auto db = std::make_shared<Database>(":memory:", 6);
+    auto db = std::make_shared<Database>(":memory:", lumivale::sqlite::kOpenReadWriteCreate);
     DeltaQueueStorage storage(db);
     EXPECT_DEATH(storage.updateDeltaStatus(makeDelta("a:b", 1, "k"), Status::PERSISTED),
                  "Assert \\(DeltaQueueStorage:[0-9]+\\): Deltas with status=PERSISTED should be deleted from the queue");

@@ -28,7 +28,7 @@ class VersionIdGeneratorTest : public ::testing::Test {
 protected:
     void reopen() {
         generator.reset();
-        db = std::make_shared<Database>(dir.file("versions.db"), 6);
+        db = std::make_shared<Database>(dir.file("versions.db"), lumivale::sqlite::kOpenReadWriteCreate);
         generator = std::make_unique<FailingReadGenerator>(db);
     }
 
@@ -39,7 +39,7 @@ protected:
     }
 
     testsupport::TempDir dir;
-    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("versions.db"), 6);
+    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("versions.db"), lumivale::sqlite::kOpenReadWriteCreate);
     std::unique_ptr<FailingReadGenerator> generator = std::make_unique<FailingReadGenerator>(db);
 };
 

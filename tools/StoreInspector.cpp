@@ -32,7 +32,7 @@ std::vector<unsigned char> readBlob(const Statement& statement, int column) {
 }
 
 uint64_t readCount(const Statement& statement, int column) {
-    return static_cast<uint64_t>(statement(column).getInt64());
+    return statement(column).getUint64();
 }
 
 bool tableExists(Database& database, const std::string& table) {
