@@ -5,7 +5,7 @@
 #
 #   scripts/setup.sh [CONFIGURATION...]
 #
-# A cross configuration named (aarch64, armhf) adds its cross compiler,
+# The clang configuration adds clang. A cross configuration named (aarch64, armhf) adds its cross compiler,
 # qemu-user and, from Debian's multiarch packages for the target, the runtime
 # libraries the tests load (C++ runtime, SQLite) and GoogleTest's static
 # libraries. Only runtime packages are taken for the target: SQLite's and
@@ -24,6 +24,7 @@ packages=(
 )
 foreign_archs=()
 for config in "$@"; do
+  if [ "$config" = clang ]; then packages+=(clang); fi
   arch="$(cross_debian_arch "$config")"
   [ -n "$arch" ] || continue
   foreign_archs+=("$arch")

@@ -3,17 +3,18 @@
 # configuration, in this order: plain (warnings are errors; also checks the
 # installed package), asan (AddressSanitizer + UndefinedBehaviorSanitizer),
 # tsan (ThreadSanitizer, for the worker thread and the transport's callback
-# registries), then the ARM cross builds aarch64 (Android's arm64-v8a) and
+# registries), clang (clang's thread-safety analysis checks the lock
+# annotations, warnings are errors), then the ARM cross builds aarch64 (Android's arm64-v8a) and
 # armhf (armeabi-v7a), built with Debian's cross compilers and run under
 # qemu-user. Any sanitizer report fails the run.
 #
 #   scripts/test.sh              every configuration
-#   scripts/test.sh aarch64 ...  only the named ones (plain, asan, tsan, aarch64, armhf)
+#   scripts/test.sh aarch64 ...  only the named ones (plain, asan, tsan, clang, aarch64, armhf)
 set -euo pipefail
 source "$(dirname "${BASH_SOURCE[0]}")/common.sh"
 
 configs=("$@")
-[ ${#configs[@]} -eq 0 ] && configs=(plain asan tsan aarch64 armhf)
+[ ${#configs[@]} -eq 0 ] && configs=(plain asan tsan clang aarch64 armhf)
 "$repo_root/scripts/setup.sh" "${configs[@]}"
 
 export ASAN_OPTIONS="halt_on_error=1:abort_on_error=1:detect_leaks=1:strict_string_checks=1"
@@ -36,6 +37,8 @@ configure() {
              -DTESSARINE_SANITIZE=address,undefined -DTESSARINE_PACKAGE_TEST=OFF ;;
     tsan)  configure_build tsan -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON \
              -DTESSARINE_SANITIZE=thread -DTESSARINE_PACKAGE_TEST=OFF ;;
+    clang) configure_build clang -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON \
+             -DCMAKE_CXX_COMPILER=clang++ -DCMAKE_CXX_FLAGS=-Wthread-safety ;;
     # setup.sh installs only the target's SQLite runtime, without the
     # libsqlite3.so link, so the library is named here, as an Android app
     # names a prebuilt SQLite of its own.

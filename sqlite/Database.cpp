@@ -92,12 +92,12 @@ Database::ScopedLock::ScopedLock(Database& database) : connection(database.conne
 Database::ScopedLock::~ScopedLock() { connection->mutex().unlock(); }
 
 void Database::exec(const std::string& sql) {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     connection->exec(sql);
 }
 
 bool Database::isReadOnly() const {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     return sqlite3_db_readonly(connection->handle(), "main") == 1;
 }
 
@@ -106,17 +106,17 @@ bool Database::isInTransactionOnThisThread() const {
 }
 
 uint64_t Database::compiledStatementCount() const {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     return connection->compiledCount;
 }
 
 long long Database::lastInsertRowId() const {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     return sqlite3_last_insert_rowid(connection->handle());
 }
 
 Statement Database::prepare(const std::string& sql) {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     if (sqlite3_stmt* cached = connection->statements().take(sql)) return Statement(connection, cached);
     sqlite3_stmt* statement = nullptr;
     const char* tail = nullptr;
@@ -135,7 +135,7 @@ Statement Database::prepare(const std::string& sql) {
 }
 
 void Database::runInTransaction(const std::function<void()>& fn, TransactionType type) {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     Connection& c = *connection;
     const int depth = c.transactionDepth;
     c.execCached(depth == 0 ? std::string(beginSql(type)) : "SAVEPOINT " + savepointName(depth));

@@ -9,7 +9,7 @@ namespace lumivale {
 namespace sqlite {
 
 namespace {
-using Lock = std::lock_guard<ConnectionMutex>;
+using Lock = ConnectionLock;
 }
 
 Statement::Statement(std::shared_ptr<Connection> connection, sqlite3_stmt* statement)

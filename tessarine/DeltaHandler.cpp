@@ -69,7 +69,7 @@ uint64_t DeltaHandler::addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta)
     std::vector<Delta> notice;
     uint64_t versionId = 0;
     {
-        std::lock_guard<std::mutex> lock(localWriteMutex);
+        MutexLock lock(localWriteMutex);
         versionId = collectionStorage->incrementAndGetVersionId(delta.collectionName);
         delta.versionId = versionId;
         const int64_t queueId = queueAndApplyLocalDelta(delta);

@@ -28,12 +28,12 @@
 #include <atomic>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <utility>
 #include <vector>
 
+#include "platform/ThreadAnnotations.h"
 #include "tessarine/CallbackManager.h"
 #include "tessarine/CollectionStorage.h"
 #include "tessarine/Delta.h"
@@ -74,7 +74,7 @@ public:
     // in version-id order. Throws; nothing but the version id is kept on
     // failure, and nothing reaches the transport. A transport that does not
     // take the change does not fail the write: it stays queued.
-    virtual uint64_t addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta);
+    virtual uint64_t addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta) TS_EXCLUDES(localWriteMutex);
 
     void onDeltaReceived(const std::vector<SyncProtocol::Delta>& deltas);
     void onDeltaStatusUpdated(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
@@ -107,7 +107,7 @@ public:
 private:
     // Queues and applies the delta in one transaction and returns its queue
     // id; localWriteMutex is held.
-    int64_t queueAndApplyLocalDelta(const SyncProtocol::Delta& delta);
+    int64_t queueAndApplyLocalDelta(const SyncProtocol::Delta& delta) TS_REQUIRES(localWriteMutex);
     void processDelivery(const std::vector<SyncProtocol::Delta>& deltas);
     // Calls each callback with deltas (none for none); a callback's
     // std::exception is logged and the next one still runs.
@@ -134,7 +134,7 @@ private:
     // transport run (the indexer runs under it, inside the transaction).
     // Lock order: localWriteMutex before the database's lock; the delta
     // sender's lock is taken last, under either or none.
-    std::mutex localWriteMutex;
+    Mutex localWriteMutex;
 };
 
 }  // namespace tessarine

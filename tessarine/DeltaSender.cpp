@@ -40,7 +40,7 @@ DeltaSender::DeltaSender(std::shared_ptr<SyncProtocol> syncProtocol,
       clientId(std::move(clientId)) {}
 
 void DeltaSender::addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexcept {
-    std::lock_guard<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     if (queueId > lastCommittedId) lastCommittedId = queueId;
     // A change the latest resend covers goes out with it, in its place.
     if (suspended || queueId <= resend.upToId) return;
@@ -61,11 +61,11 @@ void DeltaSender::requestResend() {
         storedUpToId = deltaQueueStorage->getLastId();
     } catch (const std::exception&) {
         // Without a resend, nothing newer may go out before what is queued.
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         suspend();
         throw;
     }
-    std::lock_guard<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     ++resend.generation;
     resend.active = true;
     resend.upToId = std::max(storedUpToId, lastCommittedId);
@@ -77,7 +77,7 @@ void DeltaSender::requestResend() {
 
 void DeltaSender::sendWaiting() noexcept {
     Chunk chunk;
-    std::unique_lock<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     if (sending) return;
     sending = true;
     for (;;) {
@@ -117,7 +117,7 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
     int64_t afterId = 0;
     int64_t upToId = 0;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         if (resend.generation != generation) return;
         afterId = resend.sentUpToId;
         upToId = resend.upToId;
@@ -134,7 +134,7 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
     }
     std::optional<unsigned> completedCount;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         if (resend.generation != generation) return;  // a newer resend starts over
         if (failed) {
             suspend();
@@ -154,7 +154,7 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
 void DeltaSender::send(const Next& next) {
     const bool resent = next.kind == Next::Kind::RESEND;
     const bool taken = hand(*syncProtocol, resent ? next.resent->delta : next.live, resent);
-    std::lock_guard<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     // After a newer request, what this send did no longer matters: the new
     // resend carries everything from the start.
     if (resend.generation != next.generation) return;

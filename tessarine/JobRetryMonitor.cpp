@@ -19,7 +19,7 @@ JobRetryMonitor::JobRetryMonitor(std::chrono::milliseconds stallThreshold) : sta
 void JobRetryMonitor::attemptFailed(const std::string& error) {
     long long failedFor = 0;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         if (!current.retrying) {
             current.retrying = true;
             current.failingSince = std::chrono::system_clock::now();
@@ -37,7 +37,7 @@ void JobRetryMonitor::jobEnded(bool succeeded) {
     bool reportRecovery = false;
     long long failedFor = 0;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         reportRecovery = succeeded && stallReported;
         if (reportRecovery) failedFor = millisecondsSince(failingSinceSteady);
         current = State();
@@ -49,7 +49,7 @@ void JobRetryMonitor::jobEnded(bool succeeded) {
 }
 
 JobRetryMonitor::State JobRetryMonitor::state() const {
-    std::lock_guard<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     return current;
 }
 

@@ -2,8 +2,9 @@
 
 #include <chrono>
 #include <cstdio>
-#include <mutex>
 #include <random>
+
+#include "platform/ThreadAnnotations.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -15,9 +16,9 @@ namespace {
 
 struct RandomSource {
     RandomSource() : engine(std::random_device("default")()) {}
-    std::mutex mutex;
-    std::mt19937 engine;
-    std::uniform_int_distribution<uint32_t> distribution{0, 4294967295u};
+    Mutex mutex;
+    std::mt19937 engine TS_GUARDED_BY(mutex);
+    std::uniform_int_distribution<uint32_t> distribution TS_GUARDED_BY(mutex){0, 4294967295u};
 };
 
 RandomSource& processRandomSource() {
@@ -73,7 +74,7 @@ std::string LibraryMetadata::generateClientUuid() {
 
 uint32_t LibraryMetadata::generateRandom32() {
     RandomSource& source = processRandomSource();
-    std::lock_guard<std::mutex> lock(source.mutex);
+    MutexLock lock(source.mutex);
     return source.distribution(source.engine);
 }
 

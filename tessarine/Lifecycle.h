@@ -14,9 +14,10 @@
 #pragma once
 
 #include <functional>
-#include <mutex>
 #include <utility>
 #include <vector>
+
+#include "platform/ThreadAnnotations.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -29,10 +30,10 @@ public:
     virtual void removeStopCallback(int id);
 
 private:
-    std::vector<std::pair<int, std::function<void()>>> stopCallbacks;
-    int lastCallbackId = 0;
-    std::mutex callbacksMutex;
-    std::mutex idMutex;
+    Mutex callbacksMutex;
+    Mutex idMutex TS_ACQUIRED_AFTER(callbacksMutex);
+    std::vector<std::pair<int, std::function<void()>>> stopCallbacks TS_GUARDED_BY(callbacksMutex);
+    int lastCallbackId TS_GUARDED_BY(idMutex) = 0;
 };
 
 }  // namespace tessarine
