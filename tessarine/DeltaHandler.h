@@ -132,8 +132,8 @@ private:
     // Held from taking a local change's version id until it has committed
     // and waits to be sent, never while application callbacks or the
     // transport run (the indexer runs under it, inside the transaction).
-    // Lock order: localWriteMutex before the database's lock; the delta
-    // sender's lock is taken last, under either or none.
+    // Its place in the store's lock order: README, "How a change flows
+    // through the store".
     Mutex localWriteMutex;
 };
 

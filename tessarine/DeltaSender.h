@@ -21,9 +21,10 @@
 // change in order: sending later changes first would let the server see a
 // newer change of an object before an older one.
 //
-// Threads: every operation may be called from any thread. Locks: mutex is a
-// leaf, held only to look at or change the waiting work, never while the
-// transport or the storage is called.
+// Threads: every operation may be called from any thread. Locks: mutex is
+// the last in the store's lock order (README, "How a change flows through
+// the store"), held only to look at or change the waiting work, never while
+// the transport or the storage is called.
 #pragma once
 
 #include <cstdint>

@@ -10,7 +10,8 @@
 // Threads: any thread may call every operation. stop() holds the registry
 // lock while the callbacks run, so a callback must not add, remove or stop
 // on the same Lifecycle; a registration from another thread during stop()
-// waits until the callbacks have run. Lock order: callbacksMutex, idMutex.
+// waits until the callbacks have run. Lock order: the README's ("How a
+// change flows through the store"); idMutex is a leaf.
 #pragma once
 
 #include <functional>

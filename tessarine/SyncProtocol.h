@@ -165,8 +165,8 @@ public:
     void removeSnapshotReceivedCallback(int id);
 
 private:
-    // The callbacks of one kind of event with their ids. Lock order:
-    // listMutex, then idMutex. Its operations are defined in SyncProtocol.cpp,
+    // The callbacks of one kind of event with their ids; idMutex is a leaf
+    // taken under listMutex (the store's lock order is in the README). Its operations are defined in SyncProtocol.cpp,
     // the only place that uses them.
     template <typename... Args>
     class CallbackRegistry {
