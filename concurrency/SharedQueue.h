@@ -43,7 +43,7 @@ template <typename Item, typename Cost = defaultCost>
 class SharedQueue {
 public:
     // maxCost < 0: unbounded.
-    explicit SharedQueue(int maxCost) : maxCost(maxCost) {}
+    explicit SharedQueue(int theMaxCost) : maxCost(theMaxCost) {}
     SharedQueue(const SharedQueue&) = delete;
     SharedQueue& operator=(const SharedQueue&) = delete;
 

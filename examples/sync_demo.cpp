@@ -104,8 +104,13 @@ struct Note {
 // the notes.
 class Device {
 public:
-    Device(std::string name, std::string path, uint64_t seed, std::shared_ptr<SyncServer> server, Timeline& timeline)
-        : name(std::move(name)), path(std::move(path)), seed(seed), server(std::move(server)), timeline(timeline) {}
+    Device(std::string theName, std::string thePath, uint64_t theSeed, std::shared_ptr<SyncServer> theServer,
+           Timeline& theTimeline)
+        : name(std::move(theName)),
+          path(std::move(thePath)),
+          seed(theSeed),
+          server(std::move(theServer)),
+          timeline(theTimeline) {}
 
     // Opens the store on a new connection to the server and subscribes to the
     // notes. The callback prints every change the application hears of.

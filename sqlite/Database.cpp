@@ -33,9 +33,9 @@ std::string savepointName(int depth) { return "tessarine_nested_" + std::to_stri
 // as the owner.
 class OpenLevel {
 public:
-    OpenLevel(Connection& connection, int depth) : connection(connection), depth(depth) {
-        connection.transactionDepth = depth + 1;
-        if (depth == 0) connection.transactionOwner = std::this_thread::get_id();
+    OpenLevel(Connection& theConnection, int theDepth) : connection(theConnection), depth(theDepth) {
+        theConnection.transactionDepth = theDepth + 1;
+        if (theDepth == 0) theConnection.transactionOwner = std::this_thread::get_id();
     }
     ~OpenLevel() {
         connection.transactionDepth = depth;

@@ -12,8 +12,8 @@ namespace {
 using Lock = ConnectionLock;
 }
 
-Statement::Statement(std::shared_ptr<Connection> connection, sqlite3_stmt* statement)
-    : connection(std::move(connection)), statement(statement) {}
+Statement::Statement(std::shared_ptr<Connection> theConnection, sqlite3_stmt* theStatement)
+    : connection(std::move(theConnection)), statement(theStatement) {}
 
 Statement::Statement(Statement&& other) noexcept
     : connection(std::move(other.connection)), statement(other.statement), finished(other.finished) {

@@ -46,7 +46,7 @@ public:
 
     private:
         friend class Statement;
-        Column(const Statement& statement, int index) : statement(statement), index(index) {}
+        Column(const Statement& theStatement, int theIndex) : statement(theStatement), index(theIndex) {}
         const Statement& statement;
         int index;
     };

@@ -7,13 +7,13 @@
 namespace lumivale {
 namespace tessarine {
 
-Cursor::Cursor(lumivale::sqlite::Statement&& statement, int primaryKeyColumn, int sortKeyColumn, int blobColumn,
-               int statusColumn) noexcept
-    : statement(std::move(statement)),
-      primaryKeyColumn(primaryKeyColumn),
-      sortKeyColumn(sortKeyColumn),
-      blobColumn(blobColumn),
-      statusColumn(statusColumn) {}
+Cursor::Cursor(lumivale::sqlite::Statement&& theStatement, int thePrimaryKeyColumn, int theSortKeyColumn,
+               int theBlobColumn, int theStatusColumn) noexcept
+    : statement(std::move(theStatement)),
+      primaryKeyColumn(thePrimaryKeyColumn),
+      sortKeyColumn(theSortKeyColumn),
+      blobColumn(theBlobColumn),
+      statusColumn(theStatusColumn) {}
 
 bool Cursor::step() noexcept {
     if (!statement) return false;
@@ -21,7 +21,7 @@ bool Cursor::step() noexcept {
         hasCurrentRow = statement->step();
     } catch (const lumivale::sqlite::SQLiteException& e) {
         hasCurrentRow = false;
-        lv_printLog(lumivale::LogPriority::kWarn, "tessarine", "Cursor::step failed: %s", e.what());
+        lv_printLog(LogPriority::kWarn, "tessarine", "Cursor::step failed: %s", e.what());
     }
     return hasCurrentRow;
 }

@@ -58,8 +58,8 @@ std::string dbqueries::CountDeltasByStatus::getSql(const std::string& tableName)
     return "SELECT status, COUNT(*) FROM " + tableName + " GROUP BY status";
 }
 
-DeltaQueueStorage::DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {
+DeltaQueueStorage::DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {
     createDbTableIfNecessary();
 }
 

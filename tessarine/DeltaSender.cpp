@@ -33,11 +33,11 @@ bool hand(SyncProtocol& syncProtocol, const SyncProtocol::Delta& delta, bool res
 
 }  // namespace
 
-DeltaSender::DeltaSender(std::shared_ptr<SyncProtocol> syncProtocol,
-                         std::shared_ptr<DeltaQueueStorage> deltaQueueStorage, std::string clientId)
-    : syncProtocol(std::move(syncProtocol)),
-      deltaQueueStorage(std::move(deltaQueueStorage)),
-      clientId(std::move(clientId)) {}
+DeltaSender::DeltaSender(std::shared_ptr<SyncProtocol> theSyncProtocol,
+                         std::shared_ptr<DeltaQueueStorage> theDeltaQueueStorage, std::string theClientId)
+    : syncProtocol(std::move(theSyncProtocol)),
+      deltaQueueStorage(std::move(theDeltaQueueStorage)),
+      clientId(std::move(theClientId)) {}
 
 void DeltaSender::addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexcept {
     MutexLock lock(mutex);
@@ -129,7 +129,7 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
         deltaQueueStorage->readDeltasInIdRange(afterId, upToId, kResendChunkSize, chunk.rows);
         for (auto& row : chunk.rows) row.delta.clientId = clientId;
     } catch (const std::exception& e) {
-        lv_printLog(lumivale::LogPriority::kError, "tessarine", kResendError, e.what());
+        lv_printLog(LogPriority::kError, "tessarine", kResendError, e.what());
         failed = true;
     }
     std::optional<unsigned> completedCount;
@@ -147,7 +147,8 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
         }
     }
     if (completedCount) {
-        lv_printLog(lumivale::LogPriority::kDebug, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)", *completedCount);
+        lv_printLog(LogPriority::kDebug, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)",
+                    *completedCount);
     }
 }
 

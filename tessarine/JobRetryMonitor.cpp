@@ -14,7 +14,7 @@ long long millisecondsSince(std::chrono::steady_clock::time_point start) {
 
 }  // namespace
 
-JobRetryMonitor::JobRetryMonitor(std::chrono::milliseconds stallThreshold) : stallThreshold(stallThreshold) {}
+JobRetryMonitor::JobRetryMonitor(std::chrono::milliseconds theStallThreshold) : stallThreshold(theStallThreshold) {}
 
 void JobRetryMonitor::attemptFailed(const std::string& error) {
     long long failedFor = 0;
@@ -30,7 +30,8 @@ void JobRetryMonitor::attemptFailed(const std::string& error) {
         stallReported = true;
         failedFor = millisecondsSince(failingSinceSteady);
     }
-    lv_printLog(lumivale::LogPriority::kError, "tessarine", "Store stalled: a job has been failing for %lld ms: %s", failedFor, error.c_str());
+    lv_printLog(LogPriority::kError, "tessarine", "Store stalled: a job has been failing for %lld ms: %s",
+                failedFor, error.c_str());
 }
 
 void JobRetryMonitor::jobEnded(bool succeeded) {
@@ -44,7 +45,8 @@ void JobRetryMonitor::jobEnded(bool succeeded) {
         stallReported = false;
     }
     if (reportRecovery) {
-        lv_printLog(lumivale::LogPriority::kInfo, "tessarine", "Store recovered: a job succeeded after failing for %lld ms", failedFor);
+        lv_printLog(LogPriority::kInfo, "tessarine", "Store recovered: a job succeeded after failing for %lld ms",
+                    failedFor);
     }
 }
 

@@ -34,7 +34,7 @@ void appendHex8(std::string& text, uint32_t value) {
 
 }  // namespace
 
-LibraryMetadata::LibraryMetadata(std::shared_ptr<LibraryMetadataStorage> storage) : storage(std::move(storage)) {
+LibraryMetadata::LibraryMetadata(std::shared_ptr<LibraryMetadataStorage> theStorage) : storage(std::move(theStorage)) {
     init();
 }
 

@@ -19,7 +19,7 @@ constexpr flatbuffers::uoffset_t kMaxTables = 1000000;
 constexpr size_t kInitialBuilderSize = 1024;
 
 [[noreturn]] void rejectBuffer(const char* logLine, const char* message) {
-    lv_printLog(lumivale::LogPriority::kError, kTag, "%s", logLine);
+    lv_printLog(LogPriority::kError, kTag, "%s", logLine);
     throw std::runtime_error(message);
 }
 

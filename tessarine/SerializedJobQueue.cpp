@@ -20,10 +20,10 @@ constexpr std::chrono::milliseconds kIdleWait(4294967295LL);
 
 }  // namespace
 
-SerializedJobQueue::SerializedJobQueue(std::shared_ptr<ThreadCreator> threadCreator,
-                                       ExponentialBackoff<std::chrono::milliseconds> backoff,
+SerializedJobQueue::SerializedJobQueue(std::shared_ptr<ThreadCreator> theThreadCreator,
+                                       ExponentialBackoff<std::chrono::milliseconds> theBackoff,
                                        std::chrono::milliseconds stallThreshold)
-    : jobs(-1), threadCreator(std::move(threadCreator)), backoff(backoff), retryMonitor(stallThreshold) {
+    : jobs(-1), threadCreator(std::move(theThreadCreator)), backoff(theBackoff), retryMonitor(stallThreshold) {
     if (!this->threadCreator) throw std::runtime_error("SerializedJobQueue needs a ThreadCreator");
     if (!this->backoff.isValid()) throw std::runtime_error("SerializedJobQueue: invalid back-off");
     std::thread thread = this->threadCreator->createThread([this] { mainLoop(); });
@@ -120,7 +120,8 @@ std::optional<std::string> SerializedJobQueue::attempt(const Job& job) {
     } catch (const std::exception& e) {
         return std::string(e.what());  // the job has logged what went wrong
     } catch (...) {
-        lv_printLog(lumivale::LogPriority::kError, "tessarine", "Job failed with an exception not derived from std::exception; retrying");
+        lv_printLog(LogPriority::kError, "tessarine",
+                    "Job failed with an exception not derived from std::exception; retrying");
         return std::string("an exception not derived from std::exception");
     }
 }

@@ -7,8 +7,8 @@
 namespace lumivale {
 namespace tessarine {
 
-SubscriptionStorage::SubscriptionStorage(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {
+SubscriptionStorage::SubscriptionStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {
     createDbTableIfNecessary();
 }
 

@@ -21,17 +21,17 @@ std::unique_ptr<Tessarine> Tessarine::open(const std::string& path, std::shared_
         return std::make_unique<Tessarine>(std::move(syncProtocol), std::move(threadCreator),
                                            createSqliteDatabase(path, TessarineOptions()), path);
     } catch (const std::exception& e) {
-        lv_printLog(lumivale::LogPriority::kError, "tessarine", "Error while creating tessarine instance: %s", e.what());
+        lv_printLog(LogPriority::kError, "tessarine", "Error while creating tessarine instance: %s", e.what());
         return nullptr;
     }
 }
 
-Tessarine::Tessarine(std::shared_ptr<SyncProtocol> syncProtocol, std::shared_ptr<ThreadCreator> threadCreator,
-                     std::shared_ptr<lumivale::sqlite::Database> database, const std::string& path)
-    : syncProtocol(syncProtocol),
-      threadCreator(threadCreator),
-      components(buildStoreComponents(syncProtocol, threadCreator, std::move(database))),
-      path(path) {}
+Tessarine::Tessarine(std::shared_ptr<SyncProtocol> theSyncProtocol, std::shared_ptr<ThreadCreator> theThreadCreator,
+                     std::shared_ptr<lumivale::sqlite::Database> database, const std::string& thePath)
+    : syncProtocol(theSyncProtocol),
+      threadCreator(theThreadCreator),
+      components(buildStoreComponents(theSyncProtocol, theThreadCreator, std::move(database))),
+      path(thePath) {}
 
 Tessarine::~Tessarine() = default;
 
@@ -39,7 +39,7 @@ void Tessarine::start() noexcept { syncProtocol->start(); }
 
 std::unique_ptr<Collection> Tessarine::subscribeCollection(const std::string& collectionName) noexcept {
     if (!Collection::isValidCollectionName(collectionName)) {
-        lv_printLog(lumivale::LogPriority::kError, "tessarine", "Error subscribing to a collection: Invalid collection name.");
+        lv_printLog(LogPriority::kError, "tessarine", "Error subscribing to a collection: Invalid collection name.");
         return nullptr;
     }
     try {
@@ -51,7 +51,8 @@ std::unique_ptr<Collection> Tessarine::subscribeCollection(const std::string& co
         components.subscriptionManager->subscribeCollection(collectionName);
         return collection;
     } catch (const std::exception& e) {
-        lv_printLog(lumivale::LogPriority::kError, "tessarine", "Error while subscribing to collection %s: %s", collectionName.c_str(), e.what());
+        lv_printLog(LogPriority::kError, "tessarine", "Error while subscribing to collection %s: %s",
+                    collectionName.c_str(), e.what());
         return nullptr;
     }
 }
@@ -60,7 +61,7 @@ std::optional<SyncMetrics> Tessarine::getSyncMetrics() const noexcept {
     try {
         return components.syncMetrics->read();
     } catch (const std::exception& e) {
-        lv_printLog(lumivale::LogPriority::kError, "tessarine", "Error while reading sync metrics: %s", e.what());
+        lv_printLog(LogPriority::kError, "tessarine", "Error while reading sync metrics: %s", e.what());
         return std::nullopt;
     }
 }

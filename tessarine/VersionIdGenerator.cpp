@@ -8,8 +8,8 @@
 namespace lumivale {
 namespace tessarine {
 
-VersionIdGenerator::VersionIdGenerator(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {
+VersionIdGenerator::VersionIdGenerator(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {
     createVersionIdTable();
 }
 

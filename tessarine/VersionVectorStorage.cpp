@@ -5,8 +5,8 @@
 namespace lumivale {
 namespace tessarine {
 
-VersionVectorStorage::VersionVectorStorage(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {
+VersionVectorStorage::VersionVectorStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {
     this->database->exec("CREATE TABLE IF NOT EXISTS " + getTableName() +
                          " (collection_name VARCHAR(256),client_id VARCHAR(128),version_id UNSIGNED BIG INT,"
                          "PRIMARY KEY (collection_name, client_id))");

@@ -77,8 +77,8 @@ private:
 // callback has heard the previous one.
 class RemoteFeed {
 public:
-    RemoteFeed(std::shared_ptr<SyncProtocol> transport, uint64_t firstSequenceNumber)
-        : transport(std::move(transport)), next(firstSequenceNumber) {}
+    RemoteFeed(std::shared_ptr<SyncProtocol> theTransport, uint64_t firstSequenceNumber)
+        : transport(std::move(theTransport)), next(firstSequenceNumber) {}
 
     void onApplied(const std::vector<Delta>& deltas) {
         if (deltas.empty() || deltas.front().collectionName != "crash:remote") return;

@@ -55,12 +55,12 @@ std::string describe(const lumivale::sqlite::SQLiteException& e) {
 
 }  // namespace
 
-StoreInspector::StoreInspector(const std::string& path) : path(path) {
+StoreInspector::StoreInspector(const std::string& thePath) : path(thePath) {
     // SQLite would report a missing file only as "unable to open".
     std::error_code error;
-    if (!std::filesystem::is_regular_file(path, error)) throw InspectError("no such file: " + path);
+    if (!std::filesystem::is_regular_file(thePath, error)) throw InspectError("no such file: " + thePath);
     try {
-        database = std::make_shared<Database>(path, SQLITE_OPEN_READONLY);
+        database = std::make_shared<Database>(thePath, SQLITE_OPEN_READONLY);
         database->exec("PRAGMA busy_timeout=" + std::to_string(kBusyTimeout.count()));
     } catch (const lumivale::sqlite::SQLiteException& e) {
         throw InspectError(describe(e));
