@@ -8,6 +8,7 @@
 #include "sqlite/SQLiteException.h"
 #include "tessarine/Tessarine.h"
 
+using lumivale::sqlite::kOpenReadWriteCreate;
 using lumivale::sqlite::Database;
 using lumivale::sqlite::SQLiteException;
 using lumivale::tessarine::Tessarine;
@@ -95,10 +96,10 @@ TEST(StoreDatabaseTest, RemoveStopsTheStoreAndDeletesDatabaseAndCompanions) {
 TEST(StoreDatabaseTest, RemoveWithoutCompanionFilesDeletesOnlyTheDatabase) {
     testsupport::TempDir dir;
     const std::string path = dir.file("store.db");
-    Database(path, lumivale::sqlite::kOpenReadWriteCreate).exec("CREATE TABLE t (x)");  // closed again: no -wal, no -shm
+    Database(path, kOpenReadWriteCreate).exec("CREATE TABLE t (x)");  // closed again: no -wal, no -shm
     ASSERT_TRUE(Tessarine::fileExists(path));
     ASSERT_FALSE(Tessarine::fileExists(path + "-wal"));
-    EXPECT_TRUE(storeOver(std::make_shared<Database>(":memory:", lumivale::sqlite::kOpenReadWriteCreate), path)->remove());
+    EXPECT_TRUE(storeOver(std::make_shared<Database>(":memory:", kOpenReadWriteCreate), path)->remove());
     EXPECT_FALSE(Tessarine::fileExists(path));
 }
 
@@ -110,7 +111,7 @@ TEST(StoreDatabaseTest, RemoveStopsAtDatabaseThatCannotBeDeleted) {
     touch(path + "/keeps-it-non-empty");
     touch(path + "-shm");
     touch(path + "-wal");
-    EXPECT_FALSE(storeOver(std::make_shared<Database>(":memory:", lumivale::sqlite::kOpenReadWriteCreate), path)->remove());
+    EXPECT_FALSE(storeOver(std::make_shared<Database>(":memory:", kOpenReadWriteCreate), path)->remove());
     EXPECT_TRUE(Tessarine::fileExists(path + "-shm"));
     EXPECT_TRUE(Tessarine::fileExists(path + "-wal"));
     EXPECT_FALSE(Tessarine::fileExists(dir.file("never-created")));
