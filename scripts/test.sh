@@ -4,8 +4,8 @@
 # installed package), asan (AddressSanitizer + UndefinedBehaviorSanitizer),
 # tsan (ThreadSanitizer, for the worker thread and the transport's callback
 # registries), clang (clang's thread-safety analysis checks the lock
-# annotations, warnings are errors), then the ARM cross builds aarch64 (Android's arm64-v8a) and
-# armhf (armeabi-v7a), built with Debian's cross compilers and run under
+# annotations, warnings are errors), then the ARM cross builds aarch64
+# (Android's arm64-v8a) and armhf (armeabi-v7a), built with Debian's cross compilers and run under
 # qemu-user. Any sanitizer report fails the run.
 #
 #   scripts/test.sh              every configuration
