@@ -185,9 +185,9 @@ void RawDatabase::exec(const std::string& text) {
     }
 }
 
-RawStatement::RawStatement(RawDatabase& database, std::string text, bool prepareEachUse)
-    : database(database), sql(std::move(text)), prepareEachUse(prepareEachUse) {
-    if (!prepareEachUse) prepare();
+RawStatement::RawStatement(RawDatabase& theDatabase, std::string text, bool thePrepareEachUse)
+    : database(theDatabase), sql(std::move(text)), prepareEachUse(thePrepareEachUse) {
+    if (!thePrepareEachUse) prepare();
 }
 
 RawStatement::~RawStatement() { finalize(); }

@@ -72,11 +72,6 @@ public:
     std::atomic<uint64_t> subscriptionsSent{0};
 };
 
-class PlainThreadCreator : public ThreadCreator {
-public:
-    std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
-};
-
 // Counts the deltas the application's callback has seen, and lets the
 // benchmark wait for a count.
 class CallbackCounter {
@@ -199,7 +194,7 @@ struct OpenStore {
     ~OpenStore();
 
     std::shared_ptr<CountingTransport> transport = std::make_shared<CountingTransport>();
-    std::shared_ptr<PlainThreadCreator> threadCreator = std::make_shared<PlainThreadCreator>();
+    std::shared_ptr<StdThreadCreator> threadCreator = std::make_shared<StdThreadCreator>();
     std::shared_ptr<CallbackCounter> callbacks = std::make_shared<CallbackCounter>();
     std::unique_ptr<lumivale::tessarine::Tessarine> store;
     std::unique_ptr<lumivale::tessarine::Collection> collection;

@@ -2,8 +2,8 @@
 
 namespace bench {
 
-FloorWrites::FloorWrites(RawDatabase& database, CountingTransport& transport, bool prepareEachUse)
-    : transport(transport),
+FloorWrites::FloorWrites(RawDatabase& database, CountingTransport& theTransport, bool prepareEachUse)
+    : transport(theTransport),
       begin(database, sql::kBegin, prepareEachUse),
       commit(database, sql::kCommit, prepareEachUse),
       incrementVersionId(database, sql::kIncrementVersionId, prepareEachUse),

@@ -29,7 +29,7 @@ constexpr uint64_t kQueuedForMemory = 100000;
 constexpr uint64_t kQueuedForSmallMemory = 1000;
 
 struct Environment {
-    explicit Environment(uint64_t queued) : queued(queued) {}
+    explicit Environment(uint64_t theQueued) : queued(theQueued) {}
     uint64_t queued;
     ScratchDir dir;
     bool filesMade = makeSideFiles(dir, 0, queued);
@@ -61,10 +61,10 @@ void resendOurs(OpenStore& store, uint64_t queued) {
 // client id.
 class FloorResend {
 public:
-    FloorResend(RawDatabase& database, CountingTransport& transport, bool prepareEachUse,
-                bool readWholeQueueFirst = false)
-        : transport(transport),
-          readWholeQueueFirst(readWholeQueueFirst),
+    FloorResend(RawDatabase& database, CountingTransport& theTransport, bool prepareEachUse,
+                bool theReadWholeQueueFirst = false)
+        : transport(theTransport),
+          readWholeQueueFirst(theReadWholeQueueFirst),
           subscriptions(database, sql::kGetSubscriptions, prepareEachUse),
           metadata(database, sql::kGetMetadata, prepareEachUse),
           allDeltas(database, sql::kGetAllDeltas, prepareEachUse) {}

@@ -19,7 +19,7 @@ const std::vector<int64_t> kSizes = {1000, 100000, 1000000};
 using lumivale::tessarine::CollectionStorage;
 
 struct Environment {
-    explicit Environment(uint64_t objects) : objects(objects) {}
+    explicit Environment(uint64_t theObjects) : objects(theObjects) {}
     uint64_t objects;
     ScratchDir dir;
     bool filesMade = makeSideFiles(dir, objects, 0);

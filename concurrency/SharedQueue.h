@@ -14,7 +14,7 @@
 //
 // Threads: any thread may call every operation. One mutex guards the items
 // and the total cost; operations whose names end in NoLock must be called
-// with it held, through a lock obtained from lock(). An insertion wakes one
+// with it held (MutexLock on mutex()). An insertion wakes one
 // waiting consumer after the mutex has been released, so the woken thread
 // does not block on it at once. Nothing here ever calls out while holding
 // the mutex except Cost and the item's copy constructor.
@@ -22,11 +22,11 @@
 
 #include <chrono>
 #include <climits>
-#include <condition_variable>
 #include <cstddef>
 #include <deque>
-#include <mutex>
 #include <stdexcept>
+
+#include "platform/ThreadAnnotations.h"
 
 namespace lumivale {
 namespace concurrency {
@@ -43,58 +43,49 @@ template <typename Item, typename Cost = defaultCost>
 class SharedQueue {
 public:
     // maxCost < 0: unbounded.
-    explicit SharedQueue(int maxCost) : maxCost(maxCost) {}
+    explicit SharedQueue(int theMaxCost) : maxCost(theMaxCost) {}
     SharedQueue(const SharedQueue&) = delete;
     SharedQueue& operator=(const SharedQueue&) = delete;
 
     // Locks the mutex, inserts a copy of item (at the front when atFront is
     // true, else at the back), unlocks and wakes one waiting consumer.
-    void queue(const Item& item, bool atFront) {
-        std::unique_lock<std::mutex> lock(mutex);
-        queue(lock, item, atFront);
-    }
-
-    // The same with the mutex already locked through lock, which must own it;
-    // lock is unlocked before the consumer is woken, also when the insertion
-    // throws.
-    void queue(std::unique_lock<std::mutex>& lock, const Item& item, bool atFront) {
-        try {
+    void queue(const Item& item, bool atFront) TS_EXCLUDES(lock) {
+        {
+            MutexLock held(lock);
             insertNoLock(item, atFront);
-        } catch (...) {
-            lock.unlock();
-            throw;
         }
-        lock.unlock();
-        notEmpty.notify_one();
+        notEmpty.notifyOne();
     }
 
-    // A lock on the queue's mutex, for the NoLock operations and waitUntil.
-    std::unique_lock<std::mutex> lock() { return std::unique_lock<std::mutex>(mutex); }
+    // The queue's mutex, for the NoLock operations and waitUntilNotEmpty.
+    Mutex& mutex() TS_RETURN_CAPABILITY(lock) { return lock; }
 
-    // Waits, with the mutex held through lock, until an item is queued or
-    // deadline passes; returns whether an item is queued.
+    // Waits, with the mutex held, until an item is queued or deadline
+    // passes; returns whether an item is queued.
     template <typename Clock, typename Duration>
-    bool waitUntilNotEmpty(std::unique_lock<std::mutex>& lock,
-                           const std::chrono::time_point<Clock, Duration>& deadline) {
-        return notEmpty.wait_until(lock, deadline, [this] { return isNotEmptyNoLock(); });
+    bool waitUntilNotEmpty(const std::chrono::time_point<Clock, Duration>& deadline) TS_REQUIRES(lock) {
+        while (items.empty()) {
+            if (!notEmpty.waitUntil(lock, deadline)) return !items.empty();
+        }
+        return true;
     }
 
-    bool isNotEmptyNoLock() const { return !items.empty(); }
+    bool isNotEmptyNoLock() const TS_REQUIRES(lock) { return !items.empty(); }
     // The number of queued items (not their cost).
-    std::size_t sizeNoLock() const { return items.size(); }
+    std::size_t sizeNoLock() const TS_REQUIRES(lock) { return items.size(); }
 
     // The front item; the queue must not be empty. The reference is valid
     // only while the mutex stays locked.
-    const Item& frontNoLock() const { return items.front(); }
+    const Item& frontNoLock() const TS_REQUIRES(lock) { return items.front(); }
 
     // Removes the front item and its cost; the queue must not be empty.
-    void popFrontNoLock() {
+    void popFrontNoLock() TS_REQUIRES(lock) {
         totalCost -= Cost()(items.front());
         items.pop_front();
     }
 
 private:
-    void insertNoLock(const Item& item, bool atFront) {
+    void insertNoLock(const Item& item, bool atFront) TS_REQUIRES(lock) {
         int cost = Cost()(item);
         if (cost < 0) throw std::runtime_error("SharedQueue: an item may not have a negative cost");
         if (totalCost > INT_MAX - cost || (maxCost >= 0 && totalCost + cost > maxCost)) {
@@ -108,11 +99,11 @@ private:
         totalCost += cost;
     }
 
-    std::mutex mutex;
-    std::condition_variable notEmpty;  // signalled on every insertion
-    std::deque<Item> items;
-    int maxCost;
-    int totalCost = 0;
+    Mutex lock;
+    CondVar notEmpty;  // signalled on every insertion
+    std::deque<Item> items TS_GUARDED_BY(lock);
+    const int maxCost;
+    int totalCost TS_GUARDED_BY(lock) = 0;
 };
 
 }  // namespace concurrency

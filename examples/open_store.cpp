@@ -25,11 +25,6 @@ public:
     void sendSnapshotRequest(const std::string&, const std::string&) override {}
 };
 
-class PlainThreadCreator : public ThreadCreator {
-public:
-    std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
-};
-
 std::string readPragma(lumivale::sqlite::Database& database, const std::string& name) {
     auto statement = database.prepare("PRAGMA " + name);
     return statement.step() ? statement(0).getText() : "(no value)";
@@ -49,7 +44,7 @@ int main(int argc, char** argv) {
         std::fprintf(stderr, "open_store: %s\n", e.what());
         return 1;
     }
-    auto store = Tessarine::open(path, std::make_shared<OfflineTransport>(), std::make_shared<PlainThreadCreator>());
+    auto store = Tessarine::open(path, std::make_shared<OfflineTransport>(), std::make_shared<StdThreadCreator>());
     if (!store) return 1;
     auto notes = store->subscribeCollection("example:notes");
     bool saved = notes && notes->saveObject("note-1", "2026-11-22", std::vector<unsigned char>{'h', 'i'});

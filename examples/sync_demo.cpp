@@ -92,11 +92,6 @@ private:
     const std::chrono::steady_clock::time_point start = std::chrono::steady_clock::now();
 };
 
-class PlainThreadCreator : public ThreadCreator {
-public:
-    std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
-};
-
 struct Note {
     std::string key;
     std::string text;
@@ -109,8 +104,13 @@ struct Note {
 // the notes.
 class Device {
 public:
-    Device(std::string name, std::string path, uint64_t seed, std::shared_ptr<SyncServer> server, Timeline& timeline)
-        : name(std::move(name)), path(std::move(path)), seed(seed), server(std::move(server)), timeline(timeline) {}
+    Device(std::string theName, std::string thePath, uint64_t theSeed, std::shared_ptr<SyncServer> theServer,
+           Timeline& theTimeline)
+        : name(std::move(theName)),
+          path(std::move(thePath)),
+          seed(theSeed),
+          server(std::move(theServer)),
+          timeline(theTimeline) {}
 
     // Opens the store on a new connection to the server and subscribes to the
     // notes. The callback prints every change the application hears of.
@@ -197,7 +197,7 @@ private:
     uint64_t seed;
     std::shared_ptr<SyncServer> server;
     Timeline& timeline;
-    std::shared_ptr<PlainThreadCreator> threadCreator = std::make_shared<PlainThreadCreator>();
+    std::shared_ptr<StdThreadCreator> threadCreator = std::make_shared<StdThreadCreator>();
     std::shared_ptr<LoopbackTransport> transport;
     std::unique_ptr<ts::Tessarine> store;
     std::unique_ptr<ts::Collection> notes;

@@ -10,7 +10,7 @@ namespace lumivale {
 void assertInternal(const char* format, ...) {
     va_list args;
     va_start(args, format);
-    lv_vprintLog(7, "tessarine", format, args);
+    lv_vprintLog(LogPriority::kFatal, "tessarine", format, args);
     va_end(args);
     std::abort();
 }

@@ -1,7 +1,7 @@
 // Logging for the whole library.
 //
 // lv_printLog formats like printf and writes one line at an Android log
-// priority (2 verbose ... 7 fatal). On Android it goes to the Android log;
+// priority (2 verbose ... 7 fatal; lumivale::LogPriority names them). On Android it goes to the Android log;
 // elsewhere it goes to standard error as "<letter>/<tag>: <message>", with the
 // letters V D I W E F for the priorities 2 to 7.
 //
@@ -32,6 +32,16 @@ void lv_vprintLog(int priority, const char* tag, const char* format, va_list arg
 }  // extern "C"
 
 namespace lumivale {
+
+// The Android log priorities, as lv_printLog takes them.
+namespace LogPriority {
+constexpr int kVerbose = 2;
+constexpr int kDebug = 3;
+constexpr int kInfo = 4;
+constexpr int kWarn = 5;
+constexpr int kError = 6;
+constexpr int kFatal = 7;
+}  // namespace LogPriority
 
 using LogSink = std::function<void(int priority, const std::string& tag, const std::string& message)>;
 

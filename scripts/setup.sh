@@ -5,10 +5,10 @@
 #
 #   scripts/setup.sh [CONFIGURATION...]
 #
-# A cross configuration named (aarch64, armhf) adds its cross compiler,
-# qemu-user and, from Debian's multiarch packages for the target, the runtime
-# libraries the tests load (C++ runtime, SQLite) and GoogleTest's static
-# libraries. Only runtime packages are taken for the target: SQLite's and
+# The clang configuration adds clang. A cross configuration named (aarch64,
+# armhf) adds its cross compiler, qemu-user and, from Debian's multiarch
+# packages for the target, the runtime libraries the tests load (C++ runtime,
+# SQLite) and GoogleTest's static libraries. Only runtime packages are taken for the target: SQLite's and
 # FlatBuffers' headers are the build machine's, which the cross compiler also
 # reads, and the target's -dev packages would pull in a chain of packages that
 # must match the build machine's versions one for one.

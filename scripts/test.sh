@@ -3,9 +3,10 @@
 # configuration, in this order: plain (warnings are errors; also checks the
 # installed package), asan (AddressSanitizer + UndefinedBehaviorSanitizer),
 # tsan (ThreadSanitizer, for the worker thread and the transport's callback
-# registries), clang (clang++ with libc++, as the Android NDK builds), then the
-# ARM cross builds aarch64 (Android's arm64-v8a) and
-# armhf (armeabi-v7a), built with Debian's cross compilers and run under
+# registries), clang (clang++ with libc++, as the Android NDK builds, and
+# clang's thread-safety analysis checking the lock annotations), then the ARM
+# cross builds aarch64 (Android's arm64-v8a) and armhf (armeabi-v7a), built
+# with Debian's cross compilers and run under
 # qemu-user. Any sanitizer report fails the run.
 #
 #   scripts/test.sh              every configuration
@@ -63,9 +64,10 @@ configure() {
     # libc++, GoogleTest compiled from Debian's sources against it (Debian's
     # libraries are built for libstdc++, as are Google Benchmark's, so the
     # benchmarks are left out). The consumer-project checks build with the
-    # default compiler and so are left out too.
+    # default compiler and so are left out too. Its thread-safety analysis
+    # checks the lock annotations; warnings are errors.
     clang) CC=clang CXX=clang++ configure_build clang -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTESSARINE_WERROR=ON \
-             -DCMAKE_CXX_FLAGS=-stdlib=libc++ -DCMAKE_EXE_LINKER_FLAGS=-stdlib=libc++ \
+             "-DCMAKE_CXX_FLAGS=-stdlib=libc++ -Wthread-safety" -DCMAKE_EXE_LINKER_FLAGS=-stdlib=libc++ \
              -DCMAKE_SHARED_LINKER_FLAGS=-stdlib=libc++ -DTESSARINE_GTEST_SOURCE_DIR=/usr/src/googletest \
              -DTESSARINE_PACKAGE_TEST=OFF -DTESSARINE_WITH_MQTT=ON "${java_options[@]}" ;;
     asan)  configure_build asan -DCMAKE_BUILD_TYPE=Debug -DTESSARINE_WERROR=ON -DTESSARINE_WITH_MQTT=ON \

@@ -31,7 +31,7 @@ public:
     Connection& operator=(const Connection&) = delete;
 
     sqlite3* handle() const { return db; }
-    ConnectionMutex& mutex() { return lock; }
+    ConnectionMutex& mutex() TS_RETURN_CAPABILITY(lock) { return lock; }
 
     // Throws SQLiteException with the connection's current error message.
     [[noreturn]] void fail(int code, const std::string& context) const;

@@ -10,6 +10,11 @@
 namespace lumivale {
 namespace sqlite {
 
+static_assert(kOpenReadOnly == SQLITE_OPEN_READONLY && kOpenReadWrite == SQLITE_OPEN_READWRITE &&
+                  kOpenCreate == SQLITE_OPEN_CREATE,
+              "the named open flags are sqlite3.h's");
+static_assert(kErrorReadOnly == SQLITE_READONLY, "the named result code is sqlite3.h's");
+
 namespace {
 
 const char* beginSql(Database::TransactionType type) {
@@ -28,9 +33,9 @@ std::string savepointName(int depth) { return "tessarine_nested_" + std::to_stri
 // as the owner.
 class OpenLevel {
 public:
-    OpenLevel(Connection& connection, int depth) : connection(connection), depth(depth) {
-        connection.transactionDepth = depth + 1;
-        if (depth == 0) connection.transactionOwner = std::this_thread::get_id();
+    OpenLevel(Connection& theConnection, int theDepth) : connection(theConnection), depth(theDepth) {
+        theConnection.transactionDepth = theDepth + 1;
+        if (theDepth == 0) theConnection.transactionOwner = std::this_thread::get_id();
     }
     ~OpenLevel() {
         connection.transactionDepth = depth;
@@ -87,12 +92,12 @@ Database::ScopedLock::ScopedLock(Database& database) : connection(database.conne
 Database::ScopedLock::~ScopedLock() { connection->mutex().unlock(); }
 
 void Database::exec(const std::string& sql) {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     connection->exec(sql);
 }
 
 bool Database::isReadOnly() const {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     return sqlite3_db_readonly(connection->handle(), "main") == 1;
 }
 
@@ -101,17 +106,17 @@ bool Database::isInTransactionOnThisThread() const {
 }
 
 uint64_t Database::compiledStatementCount() const {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     return connection->compiledCount;
 }
 
 long long Database::lastInsertRowId() const {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     return sqlite3_last_insert_rowid(connection->handle());
 }
 
 Statement Database::prepare(const std::string& sql) {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     if (sqlite3_stmt* cached = connection->statements().take(sql)) return Statement(connection, cached);
     sqlite3_stmt* statement = nullptr;
     const char* tail = nullptr;
@@ -130,7 +135,7 @@ Statement Database::prepare(const std::string& sql) {
 }
 
 void Database::runInTransaction(const std::function<void()>& fn, TransactionType type) {
-    std::lock_guard<ConnectionMutex> lock(connection->mutex());
+    ConnectionLock lock(connection->mutex());
     Connection& c = *connection;
     const int depth = c.transactionDepth;
     c.execCached(depth == 0 ? std::string(beginSql(type)) : "SAVEPOINT " + savepointName(depth));

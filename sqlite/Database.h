@@ -21,6 +21,7 @@
 #include <memory>
 #include <string>
 
+#include "platform/ThreadAnnotations.h"
 #include "sqlite/Statement.h"
 
 namespace lumivale {
@@ -28,7 +29,15 @@ namespace sqlite {
 
 class Connection;
 
-class Database {
+// sqlite3_open_v2's flags, named for code that does not include sqlite3.h.
+constexpr int kOpenReadOnly = 0x1;
+constexpr int kOpenReadWrite = 0x2;
+constexpr int kOpenCreate = 0x4;
+constexpr int kOpenReadWriteCreate = kOpenReadWrite | kOpenCreate;
+
+// A capability for the thread-safety analysis: the connection's lock, as
+// Database::ScopedLock holds it.
+class TS_CAPABILITY("mutex") Database {
 public:
     // How a transaction takes its locks. The store always uses Immediate (2):
     // it takes the write lock at BEGIN, so a transaction that has started can
@@ -45,10 +54,10 @@ public:
     // nothing is begun, committed or rolled back. The rule for transactions
     // holds here too: do not wait for another thread that uses this database
     // while holding it. Not copyable or movable; one thread.
-    class ScopedLock {
+    class TS_SCOPED_CAPABILITY ScopedLock {
     public:
-        explicit ScopedLock(Database& database);
-        ~ScopedLock();
+        explicit ScopedLock(Database& database) TS_ACQUIRE(database) TS_NO_THREAD_SAFETY_ANALYSIS;
+        ~ScopedLock() TS_RELEASE() TS_NO_THREAD_SAFETY_ANALYSIS;
         ScopedLock(const ScopedLock&) = delete;
         ScopedLock& operator=(const ScopedLock&) = delete;
 
@@ -56,7 +65,7 @@ public:
         std::shared_ptr<Connection> connection;
     };
 
-    // flags are sqlite3_open_v2's (the store passes read-write | create).
+    // flags are sqlite3_open_v2's (the store passes kOpenReadWriteCreate).
     // "" and ":memory:" keep SQLite's meaning.
     Database(const std::string& path, int flags);
     ~Database();

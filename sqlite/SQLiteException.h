@@ -11,6 +11,9 @@
 namespace lumivale {
 namespace sqlite {
 
+// SQLite's result code for a write refused by a database opened read-only.
+constexpr int kErrorReadOnly = 8;
+
 class SQLiteException : public std::runtime_error {
 public:
     SQLiteException(int code, const std::string& sqliteMessage, const std::string& context);

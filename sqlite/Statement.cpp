@@ -9,11 +9,11 @@ namespace lumivale {
 namespace sqlite {
 
 namespace {
-using Lock = std::lock_guard<ConnectionMutex>;
+using Lock = ConnectionLock;
 }
 
-Statement::Statement(std::shared_ptr<Connection> connection, sqlite3_stmt* statement)
-    : connection(std::move(connection)), statement(statement) {}
+Statement::Statement(std::shared_ptr<Connection> theConnection, sqlite3_stmt* theStatement)
+    : connection(std::move(theConnection)), statement(theStatement) {}
 
 Statement::ScopedLock::ScopedLock(const Statement& statement) : connection(*statement.connection) {
     connection.mutex().lock();
@@ -71,6 +71,8 @@ void Statement::bind(int index, long long value) {
     int rc = sqlite3_bind_int64(s, index, static_cast<sqlite3_int64>(value));
     if (rc != SQLITE_OK) fail(rc, "binding");
 }
+
+void Statement::bind(int index, uint64_t value) { bind(index, static_cast<long long>(value)); }
 
 void Statement::bind(int index, const std::string& value) { bindText(index, value, SQLITE_TRANSIENT); }
 
@@ -138,6 +140,8 @@ long long Statement::Column::getInt64() const {
     Lock lock(statement.connection->mutex());
     return sqlite3_column_int64(s, index);
 }
+
+uint64_t Statement::Column::getUint64() const { return static_cast<uint64_t>(getInt64()); }
 
 std::string Statement::Column::getText() const {
     sqlite3_stmt* s = statement.checkedHandle("reading a column");

@@ -16,6 +16,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -35,6 +36,8 @@ public:
     public:
         int getInt() const;
         long long getInt64() const;
+        // The 64 bits as bind(int, uint64_t) stored them.
+        uint64_t getUint64() const;
         std::string getText() const;  // empty for NULL; may hold zero bytes
         // Copies the text into target, reusing its storage.
         void copyTextTo(std::string& target) const;
@@ -47,7 +50,7 @@ public:
 
     private:
         friend class Statement;
-        Column(const Statement& statement, int index) : statement(statement), index(index) {}
+        Column(const Statement& theStatement, int theIndex) : statement(theStatement), index(theIndex) {}
         const Statement& statement;
         int index;
     };
@@ -74,6 +77,9 @@ public:
 
     void bind(int index, int value);
     void bind(int index, long long value);
+    // Stored as SQLite's signed 64-bit integer, bit for bit: values above
+    // INT64_MAX read back negative with getInt64, intact with getUint64.
+    void bind(int index, uint64_t value);
     void bind(int index, const std::string& value);  // TEXT, copied at bind time
     // A BLOB of size bytes, copied at bind time. (nullptr, 0) binds an empty
     // blob, not NULL.

@@ -9,14 +9,14 @@ CallbackManager::~CallbackManager() = default;
 
 void CallbackManager::addDeltaReceivedCallback(const DeltaReceivedCallback& callback) {
     auto stored = std::make_shared<const DeltaReceivedCallback>(callback);
-    std::lock_guard<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     deltaReceivedCallbacks.push_back(std::move(stored));
 }
 
 std::vector<CallbackManager::DeltaReceivedCallback> CallbackManager::getDeltaReceivedCallbacks() const {
     std::vector<std::shared_ptr<const DeltaReceivedCallback>> stored;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         stored = deltaReceivedCallbacks;
     }
     std::vector<DeltaReceivedCallback> callbacks;
@@ -28,7 +28,7 @@ std::vector<CallbackManager::DeltaReceivedCallback> CallbackManager::getDeltaRec
 void CallbackManager::setCollectionIndexerFunction(CollectionIndexerFunction indexer) {
     auto replacement = std::make_shared<const CollectionIndexerFunction>(std::move(indexer));
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         collectionIndexerFunction.swap(replacement);
     }
     // replacement now holds the previous indexer, released here outside the
@@ -38,7 +38,7 @@ void CallbackManager::setCollectionIndexerFunction(CollectionIndexerFunction ind
 CallbackManager::CollectionIndexerFunction CallbackManager::getCollectionIndexerFunction() const {
     std::shared_ptr<const CollectionIndexerFunction> stored;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         stored = collectionIndexerFunction;
     }
     return stored ? *stored : CollectionIndexerFunction();

@@ -19,11 +19,11 @@
 
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
+#include "platform/ThreadAnnotations.h"
 #include "tessarine/Delta.h"
 
 namespace lumivale {
@@ -49,9 +49,9 @@ public:
     virtual CollectionIndexerFunction getCollectionIndexerFunction() const;
 
 private:
-    std::vector<std::shared_ptr<const DeltaReceivedCallback>> deltaReceivedCallbacks;
-    std::shared_ptr<const CollectionIndexerFunction> collectionIndexerFunction;
-    mutable std::mutex mutex;
+    mutable Mutex mutex;
+    std::vector<std::shared_ptr<const DeltaReceivedCallback>> deltaReceivedCallbacks TS_GUARDED_BY(mutex);
+    std::shared_ptr<const CollectionIndexerFunction> collectionIndexerFunction TS_GUARDED_BY(mutex);
 };
 
 }  // namespace tessarine

@@ -18,13 +18,14 @@ const char* const kQueryError = "Error while querying collection: %s";
 
 }  // namespace
 
-Collection::Collection(std::shared_ptr<CollectionStorage> collectionStorage, std::shared_ptr<DeltaHandler> deltaHandler,
-                       std::shared_ptr<SnapshotGenerator> snapshotGenerator, const std::string& collectionName)
-    : collectionStorage(std::move(collectionStorage)),
-      deltaHandler(std::move(deltaHandler)),
-      snapshotGenerator(std::move(snapshotGenerator)),
-      collectionName(collectionName) {
-    this->collectionStorage->ensureTableExistsForCollection(collectionName);
+Collection::Collection(std::shared_ptr<CollectionStorage> theCollectionStorage,
+                       std::shared_ptr<DeltaHandler> theDeltaHandler,
+                       std::shared_ptr<SnapshotGenerator> theSnapshotGenerator, const std::string& theCollectionName)
+    : collectionStorage(std::move(theCollectionStorage)),
+      deltaHandler(std::move(theDeltaHandler)),
+      snapshotGenerator(std::move(theSnapshotGenerator)),
+      collectionName(theCollectionName) {
+    this->collectionStorage->ensureTableExistsForCollection(theCollectionName);
 }
 
 bool Collection::isValidCollectionName(const std::string& name) {
@@ -43,7 +44,7 @@ std::unique_ptr<Cursor> Collection::query(const std::string& sortKey, int limit,
         return collectionStorage->query(collectionName, sortKey, limit,
                                         direction == CollectionStorage::SortDirection::ASCENDING);
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", kQueryError, e.what());
+        lv_printLog(LogPriority::kError, "tessarine", kQueryError, e.what());
         return nullptr;
     }
 }
@@ -53,7 +54,7 @@ std::unique_ptr<Cursor> Collection::queryWithIndex(const std::string& indexQuery
     try {
         return collectionStorage->queryWithIndex(collectionName, indexQuery, indexQueryArgs, limit);
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", kQueryError, e.what());
+        lv_printLog(LogPriority::kError, "tessarine", kQueryError, e.what());
         return nullptr;
     }
 }
@@ -66,7 +67,7 @@ std::unique_ptr<Cursor> Collection::queryWithIndexSorted(const std::string& inde
         return collectionStorage->queryWithIndexSorted(collectionName, indexQuery, indexQueryArgs, sortFieldName,
                                                        direction, limit);
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", kQueryError, e.what());
+        lv_printLog(LogPriority::kError, "tessarine", kQueryError, e.what());
         return nullptr;
     }
 }
@@ -75,7 +76,7 @@ std::unique_ptr<Cursor> Collection::getObject(const std::string& primaryKey) noe
     try {
         return collectionStorage->getObject(collectionName, primaryKey);
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", "Error while getting object from collection: %s", e.what());
+        lv_printLog(LogPriority::kError, "tessarine", "Error while getting object from collection: %s", e.what());
         return nullptr;
     }
 }
@@ -84,7 +85,7 @@ bool Collection::saveObject(const std::string& primaryKey, const std::string& so
                             unsigned int blobSize) noexcept {
     const char* const error = "Error while updating object: %s";
     if (blob == nullptr && blobSize != 0) {
-        lv_printLog(6, "tessarine", error, "the blob has a size but no data");
+        lv_printLog(LogPriority::kError, "tessarine", error, "the blob has a size but no data");
         return false;
     }
     return write(SyncProtocol::DeltaType::SAVE, primaryKey, sortKey, blob, blobSize, error);
@@ -114,7 +115,7 @@ bool Collection::write(SyncProtocol::DeltaType type, const std::string& primaryK
         deltaHandler->addLocalDeltaWithNextVersionId(std::move(delta));
         return true;
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", errorFormat, e.what());
+        lv_printLog(LogPriority::kError, "tessarine", errorFormat, e.what());
         return false;
     }
 }

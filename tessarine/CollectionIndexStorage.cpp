@@ -8,8 +8,8 @@
 namespace lumivale {
 namespace tessarine {
 
-CollectionIndexStorage::CollectionIndexStorage(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {}
+CollectionIndexStorage::CollectionIndexStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {}
 
 CollectionIndexStorage::~CollectionIndexStorage() = default;
 

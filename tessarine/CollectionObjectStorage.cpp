@@ -16,8 +16,8 @@ constexpr int kBlobColumn = 2;
 constexpr int kStatusColumn = 3;
 }  // namespace
 
-CollectionObjectStorage::CollectionObjectStorage(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {}
+CollectionObjectStorage::CollectionObjectStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {}
 
 CollectionObjectStorage::~CollectionObjectStorage() = default;
 

@@ -35,16 +35,16 @@ std::unique_ptr<Cursor> makeObjectCursor(lumivale::sqlite::Statement&& statement
 
 }  // namespace
 
-CollectionStorage::CollectionStorage(std::shared_ptr<lumivale::sqlite::Database> database,
-                                     std::shared_ptr<CallbackManager> callbackManager,
-                                     std::shared_ptr<CollectionIndexStorage> indexStorage,
-                                     std::shared_ptr<CollectionObjectStorage> objectStorage,
-                                     std::shared_ptr<VersionIdGenerator> versionIdGenerator)
-    : database(std::move(database)),
-      callbackManager(std::move(callbackManager)),
-      indexStorage(std::move(indexStorage)),
-      objectStorage(std::move(objectStorage)),
-      versionIdGenerator(std::move(versionIdGenerator)) {}
+CollectionStorage::CollectionStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase,
+                                     std::shared_ptr<CallbackManager> theCallbackManager,
+                                     std::shared_ptr<CollectionIndexStorage> theIndexStorage,
+                                     std::shared_ptr<CollectionObjectStorage> theObjectStorage,
+                                     std::shared_ptr<VersionIdGenerator> theVersionIdGenerator)
+    : database(std::move(theDatabase)),
+      callbackManager(std::move(theCallbackManager)),
+      indexStorage(std::move(theIndexStorage)),
+      objectStorage(std::move(theObjectStorage)),
+      versionIdGenerator(std::move(theVersionIdGenerator)) {}
 
 CollectionStorage::~CollectionStorage() = default;
 

@@ -8,13 +8,13 @@
 namespace lumivale {
 namespace tessarine {
 
-Cursor::Cursor(lumivale::sqlite::Statement&& statement, int primaryKeyColumn, int sortKeyColumn, int blobColumn,
-               int statusColumn) noexcept
-    : statement(std::move(statement)),
-      primaryKeyColumn(primaryKeyColumn),
-      sortKeyColumn(sortKeyColumn),
-      blobColumn(blobColumn),
-      statusColumn(statusColumn) {}
+Cursor::Cursor(lumivale::sqlite::Statement&& theStatement, int thePrimaryKeyColumn, int theSortKeyColumn,
+               int theBlobColumn, int theStatusColumn) noexcept
+    : statement(std::move(theStatement)),
+      primaryKeyColumn(thePrimaryKeyColumn),
+      sortKeyColumn(theSortKeyColumn),
+      blobColumn(theBlobColumn),
+      statusColumn(theStatusColumn) {}
 
 bool Cursor::step() noexcept {
     if (!statement) return false;
@@ -24,7 +24,7 @@ bool Cursor::step() noexcept {
         if (hasCurrentRow) readRow();
     } catch (const std::exception& e) {
         hasCurrentRow = false;
-        lv_printLog(5, "tessarine", "Cursor::step failed: %s", e.what());
+        lv_printLog(LogPriority::kWarn, "tessarine", "Cursor::step failed: %s", e.what());
     }
     return hasCurrentRow;
 }
@@ -43,8 +43,7 @@ void Cursor::close() noexcept {
 
 void Cursor::checkCurrentRow() const noexcept {
     if (!hasCurrentRow) {
-        lumivale::assertInternal("Assert (%s:%d): There's no current row. Did you forget to call step()?", "Cursor",
-                                 __LINE__);
+        LV_ASSERT_FAIL("Cursor", "There's no current row. Did you forget to call step()?");
     }
 }
 

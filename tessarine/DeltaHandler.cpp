@@ -26,24 +26,24 @@ bool isKnownDeltaType(SyncProtocol::DeltaType type) {
 }
 }  // namespace
 
-DeltaHandler::DeltaHandler(std::shared_ptr<lumivale::sqlite::Database> database,
-                           std::shared_ptr<CallbackManager> callbackManager,
-                           std::shared_ptr<CollectionStorage> collectionStorage,
-                           std::shared_ptr<DeltaQueue> deltaQueue, std::shared_ptr<Lifecycle> lifecycle,
-                           std::shared_ptr<SyncProtocol> syncProtocol,
-                           std::shared_ptr<SerializedJobQueue> serializedJobQueue,
-                           std::shared_ptr<SubscriptionManager> subscriptionManager,
-                           std::shared_ptr<VersionVectorStorage> versionVectorStorage, std::string clientId)
-    : database(std::move(database)),
-      callbackManager(std::move(callbackManager)),
-      collectionStorage(std::move(collectionStorage)),
-      deltaQueue(std::move(deltaQueue)),
-      lifecycle(std::move(lifecycle)),
-      syncProtocol(std::move(syncProtocol)),
-      serializedJobQueue(std::move(serializedJobQueue)),
-      subscriptionManager(std::move(subscriptionManager)),
-      versionVectorStorage(std::move(versionVectorStorage)),
-      clientId(std::move(clientId)) {
+DeltaHandler::DeltaHandler(std::shared_ptr<lumivale::sqlite::Database> theDatabase,
+                           std::shared_ptr<CallbackManager> theCallbackManager,
+                           std::shared_ptr<CollectionStorage> theCollectionStorage,
+                           std::shared_ptr<DeltaQueue> theDeltaQueue, std::shared_ptr<Lifecycle> theLifecycle,
+                           std::shared_ptr<SyncProtocol> theSyncProtocol,
+                           std::shared_ptr<SerializedJobQueue> theSerializedJobQueue,
+                           std::shared_ptr<SubscriptionManager> theSubscriptionManager,
+                           std::shared_ptr<VersionVectorStorage> theVersionVectorStorage, std::string theClientId)
+    : database(std::move(theDatabase)),
+      callbackManager(std::move(theCallbackManager)),
+      collectionStorage(std::move(theCollectionStorage)),
+      deltaQueue(std::move(theDeltaQueue)),
+      lifecycle(std::move(theLifecycle)),
+      syncProtocol(std::move(theSyncProtocol)),
+      serializedJobQueue(std::move(theSerializedJobQueue)),
+      subscriptionManager(std::move(theSubscriptionManager)),
+      versionVectorStorage(std::move(theVersionVectorStorage)),
+      clientId(std::move(theClientId)) {
     lifecycleStopCallbackId = this->lifecycle->addStopCallback([this] { onLifecycleStop(); });
     deltaReceivedCallbackId = this->syncProtocol->addDeltaReceivedCallback(
         [this](const std::vector<SyncProtocol::Delta>& deltas) { onDeltaReceived(deltas); });
@@ -59,13 +59,7 @@ DeltaHandler::~DeltaHandler() {
     syncProtocol->removeDeltaReceivedCallback(deltaReceivedCallbackId);
 }
 
-void DeltaHandler::addLocalDelta(const SyncProtocol::Delta& delta) { writeLocalDelta(delta, false); }
-
-void DeltaHandler::addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta) {
-    writeLocalDelta(std::move(delta), true);
-}
-
-void DeltaHandler::writeLocalDelta(SyncProtocol::Delta delta, bool takeNextVersionId) {
+uint64_t DeltaHandler::addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta) {
     // Code that the store calls inside one of its transactions (an indexer)
     // cannot write: its change would become part of a transaction that can
     // still be rolled back, and this thread may already hold the local write
@@ -73,9 +67,11 @@ void DeltaHandler::writeLocalDelta(SyncProtocol::Delta delta, bool takeNextVersi
     if (database->isInTransactionOnThisThread()) throw std::runtime_error(kWriteInsideTransaction);
     const std::vector<CallbackManager::DeltaReceivedCallback> callbacks = callbackManager->getDeltaReceivedCallbacks();
     std::vector<Delta> notice;
+    uint64_t versionId = 0;
     {
-        std::lock_guard<std::mutex> lock(localWriteMutex);
-        if (takeNextVersionId) delta.versionId = collectionStorage->incrementAndGetVersionId(delta.collectionName);
+        MutexLock lock(localWriteMutex);
+        versionId = collectionStorage->incrementAndGetVersionId(delta.collectionName);
+        delta.versionId = versionId;
         const int64_t queueId = queueAndApplyLocalDelta(delta);
         if (!callbacks.empty()) notice.push_back(convertMQTTDeltaToApiDelta(delta, SyncProtocol::DeltaStatus::PENDING));
         // Still under the lock, so that changes wait to be sent in the order
@@ -84,6 +80,7 @@ void DeltaHandler::writeLocalDelta(SyncProtocol::Delta delta, bool takeNextVersi
     }
     notify(callbacks, notice);
     deltaQueue->sendCommitted();
+    return versionId;
 }
 
 int64_t DeltaHandler::queueAndApplyLocalDelta(const SyncProtocol::Delta& delta) {
@@ -100,7 +97,7 @@ void DeltaHandler::postJob(std::function<void()> work) {
     try {
         serializedJobQueue->addJob(SerializedJobQueue::Job{std::move(work)});
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", "Error while adding job to queue: %s", e.what());
+        lv_printLog(LogPriority::kError, "tessarine", "Error while adding job to queue: %s", e.what());
         lifecycle->stop();
     }
 }
@@ -115,9 +112,10 @@ void DeltaHandler::onDeltaReceived(const std::vector<SyncProtocol::Delta>& delta
     applicable.reserve(deltas.size());
     for (const SyncProtocol::Delta& delta : deltas) {
         if (!isKnownDeltaType(delta.type)) {
-            lv_printLog(5, "tessarine", "Dropping received delta of unknown type: %d", static_cast<int>(delta.type));
+            lv_printLog(LogPriority::kWarn, "tessarine", "Dropping received delta of unknown type: %d",
+                        static_cast<int>(delta.type));
         } else if (!Collection::isValidCollectionName(delta.collectionName)) {
-            lv_printLog(5, "tessarine", "Dropping received delta for invalid collection name: %s",
+            lv_printLog(LogPriority::kWarn, "tessarine", "Dropping received delta for invalid collection name: %s",
                         delta.collectionName.c_str());
         } else {
             applicable.push_back(delta);
@@ -145,7 +143,7 @@ void DeltaHandler::processDelivery(const std::vector<SyncProtocol::Delta>& delta
             storeDeliveryMarks(marks);
         }, kImmediate);
     } catch (const std::exception& e) {
-        lv_printLog(5, "tessarine", "Failed to process received deltas: %s", e.what());
+        lv_printLog(LogPriority::kWarn, "tessarine", "Failed to process received deltas: %s", e.what());
         throw;
     }
     callDeltaCallbacks(deltas, SyncProtocol::DeltaStatus::PERSISTED);
@@ -156,7 +154,7 @@ void DeltaHandler::processStatusUpdate(const SyncProtocol::Delta& delta, SyncPro
     try {
         database->runInTransaction([&] { recalculateAndUpdateObjectStatus(delta); }, kImmediate);
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", "Error while processing delta status update: %s", e.what());
+        lv_printLog(LogPriority::kError, "tessarine", "Error while processing delta status update: %s", e.what());
         throw;
     }
     callDeltaCallbacks({delta}, status);
@@ -204,8 +202,7 @@ void DeltaHandler::applyDelta(const SyncProtocol::Delta& delta, CollectionStorag
             collectionStorage->deleteObject(delta.collectionName, delta.primaryKey);
             return;
     }
-    lumivale::assertInternal("Assert (%s:%d): Unknown delta type: %d", "DeltaHandler", __LINE__,
-                             static_cast<int>(delta.type));
+    LV_ASSERT_FAIL("DeltaHandler", "Unknown delta type: %d", static_cast<int>(delta.type));
 }
 
 void DeltaHandler::recalculateAndUpdateObjectStatus(const SyncProtocol::Delta& delta) {
@@ -219,7 +216,7 @@ CollectionStorage::ObjectStatus DeltaHandler::convToObjectStatus(DeltaQueue::Pen
         case DeltaQueue::PendingStatus::SENT: return CollectionStorage::ObjectStatus::SENT;
         case DeltaQueue::PendingStatus::PERSISTED: return CollectionStorage::ObjectStatus::PERSISTED;
     }
-    lv_printLog(5, "tessarine", "Unknown pending status: %d", static_cast<int>(pendingStatus));
+    lv_printLog(LogPriority::kWarn, "tessarine", "Unknown pending status: %d", static_cast<int>(pendingStatus));
     return CollectionStorage::ObjectStatus::PERSISTED;
 }
 
@@ -241,7 +238,7 @@ void DeltaHandler::notify(const std::vector<CallbackManager::DeltaReceivedCallba
         try {
             callback(deltas);
         } catch (const std::exception& e) {
-            lv_printLog(5, "tessarine", "Exception in delta callback: %s", e.what());
+            lv_printLog(LogPriority::kWarn, "tessarine", "Exception in delta callback: %s", e.what());
         }
     }
 }
@@ -255,13 +252,13 @@ Delta DeltaHandler::convertMQTTDeltaToApiDelta(const SyncProtocol::Delta& delta,
     if (isKnownDeltaType(delta.type)) {
         apiDelta.type = delta.type;
     } else {
-        lv_printLog(5, "tessarine", "Unknown delta type: %d", static_cast<int>(delta.type));
+        lv_printLog(LogPriority::kWarn, "tessarine", "Unknown delta type: %d", static_cast<int>(delta.type));
     }
     int statusNumber = static_cast<int>(status);
     if (statusNumber >= 1 && statusNumber <= 3) {
         apiDelta.status = status;
     } else {
-        lv_printLog(5, "tessarine", "Unknow delta status: %d", statusNumber);
+        lv_printLog(LogPriority::kWarn, "tessarine", "Unknow delta status: %d", statusNumber);
     }
     return apiDelta;
 }

@@ -1,12 +1,12 @@
 // Where every change to an object becomes a delta and every delta a change.
 //
-// Local path (application thread): addLocalDelta queues the delta and writes
+// Local path (application thread): addLocalDeltaWithNextVersionId gives the
+// delta its collection's next version id, queues it and writes
 // the object with status PENDING in one transaction; once that has
 // committed it tells the application's callbacks and hands the delta to the
 // transport (through the delta queue's sender), holding no lock, so a write
 // that failed never reaches the transport. Local writes are serialised by a
-// lock of their own, which addLocalDeltaWithNextVersionId also holds while
-// it takes the version id, so each collection's changes reach the queue and
+// lock of their own, also held while the version id is taken, so each collection's changes reach the queue and
 // the transport in version-id order whatever threads write. A write from
 // code that the store runs inside one of its transactions (the indexer) is
 // refused: it could still be rolled back. Incoming path (transport thread, then the
@@ -18,7 +18,7 @@
 //
 // The application's callbacks run outside every transaction: on the writing
 // thread after a local write, on the worker otherwise. After the lifecycle
-// stops, addLocalDelta throws "DeltaHandler already stopped" and events are
+// stops, a local write throws "DeltaHandler already stopped" and events are
 // dropped. Registers with the lifecycle, the transport and the delta queue on
 // construction; destruction removes the first two after stopping the job
 // queue (the worker is the only caller of the queue listener). Must not be
@@ -28,12 +28,12 @@
 #include <atomic>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <utility>
 #include <vector>
 
+#include "platform/ThreadAnnotations.h"
 #include "tessarine/CallbackManager.h"
 #include "tessarine/CollectionStorage.h"
 #include "tessarine/Delta.h"
@@ -65,17 +65,16 @@ public:
     DeltaHandler(const DeltaHandler&) = delete;
     DeltaHandler& operator=(const DeltaHandler&) = delete;
 
-    // The caller has filled collectionName, versionId, type, primaryKey and,
-    // for a save, sortKey and blob. Throws; nothing is kept on failure, and
-    // nothing reaches the transport. A transport that does not take the
-    // change does not fail the write: it stays queued.
-    virtual void addLocalDelta(const SyncProtocol::Delta& delta);
-    // The local write path of a Collection: takes the collection's next
-    // version id (committed on its own, so that a failed write uses it up),
-    // then adds the delta as addLocalDelta does. Both steps happen under one
-    // lock, so that concurrent writers hand each collection's changes to the
-    // queue and the transport in version-id order. Throws as addLocalDelta.
-    virtual void addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta);
+    // The local write path of a Collection. The caller has filled
+    // collectionName, type, primaryKey and, for a save, sortKey and blob.
+    // Takes the collection's next version id (committed on its own, so that
+    // a failed write uses it up) and returns it, then queues the delta and
+    // applies it. Both steps happen under one lock, so that concurrent
+    // writers hand each collection's changes to the queue and the transport
+    // in version-id order. Throws; nothing but the version id is kept on
+    // failure, and nothing reaches the transport. A transport that does not
+    // take the change does not fail the write: it stays queued.
+    virtual uint64_t addLocalDeltaWithNextVersionId(SyncProtocol::Delta delta) TS_EXCLUDES(localWriteMutex);
 
     void onDeltaReceived(const std::vector<SyncProtocol::Delta>& deltas);
     void onDeltaStatusUpdated(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
@@ -106,10 +105,9 @@ public:
     Delta convertMQTTDeltaToApiDelta(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
 
 private:
-    void writeLocalDelta(SyncProtocol::Delta delta, bool takeNextVersionId);
     // Queues and applies the delta in one transaction and returns its queue
     // id; localWriteMutex is held.
-    int64_t queueAndApplyLocalDelta(const SyncProtocol::Delta& delta);
+    int64_t queueAndApplyLocalDelta(const SyncProtocol::Delta& delta) TS_REQUIRES(localWriteMutex);
     void processDelivery(const std::vector<SyncProtocol::Delta>& deltas);
     // Calls each callback with deltas (none for none); a callback's
     // std::exception is logged and the next one still runs.
@@ -134,9 +132,9 @@ private:
     // Held from taking a local change's version id until it has committed
     // and waits to be sent, never while application callbacks or the
     // transport run (the indexer runs under it, inside the transaction).
-    // Lock order: localWriteMutex before the database's lock; the delta
-    // sender's lock is taken last, under either or none.
-    std::mutex localWriteMutex;
+    // Its place in the store's lock order: README, "How a change flows
+    // through the store".
+    Mutex localWriteMutex;
 };
 
 }  // namespace tessarine

@@ -20,21 +20,20 @@ int rank(SyncProtocol::DeltaStatus status) {
         case SyncProtocol::DeltaStatus::SENT: return 1;
         case SyncProtocol::DeltaStatus::PERSISTED: return 2;
     }
-    lumivale::assertInternal("Assert (%s:%d): Invalid delta status: %d", "DeltaQueue", __LINE__,
-                             static_cast<int>(status));
+    LV_ASSERT_FAIL("DeltaQueue", "Invalid delta status: %d", static_cast<int>(status));
 }
 
 }  // namespace
 
-DeltaQueue::DeltaQueue(std::shared_ptr<lumivale::sqlite::Database> database, std::shared_ptr<Lifecycle> lifecycle,
-                       std::shared_ptr<DeltaQueueStorage> deltaQueueStorage,
-                       std::shared_ptr<SerializedJobQueue> serializedJobQueue,
-                       std::shared_ptr<SyncProtocol> syncProtocol, std::string clientId)
-    : database(std::move(database)),
-      lifecycle(std::move(lifecycle)),
-      deltaQueueStorage(std::move(deltaQueueStorage)),
-      serializedJobQueue(std::move(serializedJobQueue)),
-      syncProtocol(std::move(syncProtocol)),
+DeltaQueue::DeltaQueue(std::shared_ptr<lumivale::sqlite::Database> theDatabase, std::shared_ptr<Lifecycle> theLifecycle,
+                       std::shared_ptr<DeltaQueueStorage> theDeltaQueueStorage,
+                       std::shared_ptr<SerializedJobQueue> theSerializedJobQueue,
+                       std::shared_ptr<SyncProtocol> theSyncProtocol, std::string clientId)
+    : database(std::move(theDatabase)),
+      lifecycle(std::move(theLifecycle)),
+      deltaQueueStorage(std::move(theDeltaQueueStorage)),
+      serializedJobQueue(std::move(theSerializedJobQueue)),
+      syncProtocol(std::move(theSyncProtocol)),
       sender(this->syncProtocol, this->deltaQueueStorage, std::move(clientId)) {
     lifecycleStopCallbackId = this->lifecycle->addStopCallback([this] { onLifecycleStop(); });
     connectionEstablishedCallbackId =
@@ -77,8 +76,7 @@ DeltaQueue::PendingStatus DeltaQueue::getPendingStatus(const std::string& collec
     if (!minimum) return PendingStatus::PERSISTED;
     if (*minimum == SyncProtocol::DeltaStatus::PENDING) return PendingStatus::PENDING;
     if (*minimum == SyncProtocol::DeltaStatus::SENT) return PendingStatus::SENT;
-    lumivale::assertInternal("Assert (%s:%d): Invalid delta type: %d", "DeltaQueue", __LINE__,
-                             static_cast<int>(*minimum));
+    LV_ASSERT_FAIL("DeltaQueue", "Invalid delta type: %d", static_cast<int>(*minimum));
 }
 
 int DeltaQueue::updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
@@ -107,7 +105,8 @@ void DeltaQueue::onDeltaStatusUpdated(const SyncProtocol::DeltaStatusUpdate& upd
     // where every later reader would take it for a broken invariant.
     int statusNumber = static_cast<int>(update.status);
     if (statusNumber < 1 || statusNumber > 3) {
-        lv_printLog(5, "tessarine", "Dropping delta status update with unknown status: %d", statusNumber);
+        lv_printLog(LogPriority::kWarn, "tessarine", "Dropping delta status update with unknown status: %d",
+                    statusNumber);
         return;
     }
     SyncProtocol::Delta delta = update.delta;
@@ -117,7 +116,7 @@ void DeltaQueue::onDeltaStatusUpdated(const SyncProtocol::DeltaStatusUpdate& upd
             processDeltaStatusUpdate(delta, status);
         }});
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", "Error while adding job to queue: %s", e.what());
+        lv_printLog(LogPriority::kError, "tessarine", "Error while adding job to queue: %s", e.what());
         lifecycle->stop();
     }
 }
@@ -130,7 +129,7 @@ void DeltaQueue::processDeltaStatusUpdate(const SyncProtocol::Delta& delta, Sync
         database->runInTransaction([&] { result = updateDeltaStatus(delta, status); },
                                    lumivale::sqlite::Database::TransactionType::Immediate);
     } catch (const std::exception&) {
-        lv_printLog(5, "tessarine", "Failed to process delta status update");
+        lv_printLog(LogPriority::kWarn, "tessarine", "Failed to process delta status update");
         throw;
     }
     if (result != QUEUE_CHANGED) return;
@@ -142,7 +141,7 @@ void DeltaQueue::onConnectionEstablished() {
     try {
         sender.requestResend();
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", "Error in DeltaQueue::onConnectionEstablished: %s", e.what());
+        lv_printLog(LogPriority::kError, "tessarine", "Error in DeltaQueue::onConnectionEstablished: %s", e.what());
     }
     sender.sendWaiting();
 }

@@ -17,7 +17,7 @@ const char* const kWhereDelta = " WHERE  collection_name = ? AND   version_id = 
 // delta, reusing the storage of its strings and blob.
 void readDeltaInto(lumivale::sqlite::Statement& statement, SyncProtocol::Delta& delta) {
     statement(0).copyTextTo(delta.collectionName);
-    delta.versionId = static_cast<uint64_t>(statement(1).getInt64());
+    delta.versionId = statement(1).getUint64();
     delta.type = static_cast<SyncProtocol::DeltaType>(statement(2).getInt());
     statement(3).copyTextTo(delta.primaryKey);
     statement(4).copyTextTo(delta.sortKey);
@@ -33,7 +33,7 @@ SyncProtocol::Delta readDelta(lumivale::sqlite::Statement& statement) {
 
 void bindDeltaKey(lumivale::sqlite::Statement& statement, const SyncProtocol::Delta& delta, int firstIndex) {
     statement.bind(firstIndex, delta.collectionName);
-    statement.bind(firstIndex + 1, static_cast<long long>(delta.versionId));
+    statement.bind(firstIndex + 1, delta.versionId);
 }
 
 }  // namespace
@@ -58,8 +58,8 @@ std::string dbqueries::CountDeltasByStatus::getSql(const std::string& tableName)
     return "SELECT status, COUNT(*) FROM " + tableName + " GROUP BY status";
 }
 
-DeltaQueueStorage::DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {
+DeltaQueueStorage::DeltaQueueStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {
     createDbTableIfNecessary();
 }
 
@@ -96,8 +96,8 @@ std::vector<SyncProtocol::Delta> DeltaQueueStorage::getDeltaRangeByVersionId(con
                                        " WHERE  collection_name = ? AND   version_id >= ? AND   version_id <= ? "
                                        "ORDER BY id ASC");
     statement.bind(1, collectionName);
-    statement.bind(2, static_cast<long long>(lowestVersionId));
-    statement.bind(3, static_cast<long long>(highestVersionId));
+    statement.bind(2, lowestVersionId);
+    statement.bind(3, highestVersionId);
     std::vector<SyncProtocol::Delta> result;
     while (statement.step()) result.push_back(readDelta(statement));
     return result;
@@ -154,7 +154,7 @@ std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> DeltaQueueStorage::c
     std::vector<std::pair<SyncProtocol::DeltaStatus, uint64_t>> result;
     while (statement.step()) {
         result.emplace_back(static_cast<SyncProtocol::DeltaStatus>(statement(0).getInt()),
-                            static_cast<uint64_t>(statement(1).getInt64()));
+                            statement(1).getUint64());
     }
     return result;
 }
@@ -165,7 +165,7 @@ int64_t DeltaQueueStorage::insertDelta(const SyncProtocol::Delta& delta, SyncPro
         " (collection_name, version_id, type, primary_key, sort_key, blob, status) VALUES (?, ?, ?, ?, ?, ?, ?)");
     // The delta outlives the one step that writes it.
     statement.bindWithoutCopy(1, delta.collectionName);
-    statement.bind(2, static_cast<long long>(delta.versionId));
+    statement.bind(2, delta.versionId);
     statement.bind(3, static_cast<int>(delta.type));
     statement.bindWithoutCopy(4, delta.primaryKey);
     statement.bindWithoutCopy(5, delta.sortKey);
@@ -177,8 +177,7 @@ int64_t DeltaQueueStorage::insertDelta(const SyncProtocol::Delta& delta, SyncPro
 
 void DeltaQueueStorage::updateDeltaStatus(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status) {
     if (status == SyncProtocol::DeltaStatus::PERSISTED) {
-        lumivale::assertInternal("Assert (%s:%d): Deltas with status=PERSISTED should be deleted from the queue",
-                                 "DeltaQueueStorage", __LINE__);
+        LV_ASSERT_FAIL("DeltaQueueStorage", "Deltas with status=PERSISTED should be deleted from the queue");
     }
     auto statement = database->prepare("UPDATE " + getTableName() + " SET status = ?" + kWhereDelta);
     bindDeltaKey(statement, delta, 2);

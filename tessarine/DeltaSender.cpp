@@ -33,14 +33,14 @@ bool hand(SyncProtocol& syncProtocol, const SyncProtocol::Delta& delta, bool res
 
 }  // namespace
 
-DeltaSender::DeltaSender(std::shared_ptr<SyncProtocol> syncProtocol,
-                         std::shared_ptr<DeltaQueueStorage> deltaQueueStorage, std::string clientId)
-    : syncProtocol(std::move(syncProtocol)),
-      deltaQueueStorage(std::move(deltaQueueStorage)),
-      clientId(std::move(clientId)) {}
+DeltaSender::DeltaSender(std::shared_ptr<SyncProtocol> theSyncProtocol,
+                         std::shared_ptr<DeltaQueueStorage> theDeltaQueueStorage, std::string theClientId)
+    : syncProtocol(std::move(theSyncProtocol)),
+      deltaQueueStorage(std::move(theDeltaQueueStorage)),
+      clientId(std::move(theClientId)) {}
 
 void DeltaSender::addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexcept {
-    std::lock_guard<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     if (queueId > lastCommittedId) lastCommittedId = queueId;
     // A change the latest resend covers goes out with it, in its place.
     if (suspended || queueId <= resend.upToId) return;
@@ -61,11 +61,11 @@ void DeltaSender::requestResend() {
         storedUpToId = deltaQueueStorage->getLastId();
     } catch (const std::exception&) {
         // Without a resend, nothing newer may go out before what is queued.
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         suspend();
         throw;
     }
-    std::lock_guard<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     ++resend.generation;
     resend.active = true;
     resend.upToId = std::max(storedUpToId, lastCommittedId);
@@ -77,7 +77,7 @@ void DeltaSender::requestResend() {
 
 void DeltaSender::sendWaiting() noexcept {
     Chunk chunk;
-    std::unique_lock<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     if (sending) return;
     sending = true;
     for (;;) {
@@ -117,7 +117,7 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
     int64_t afterId = 0;
     int64_t upToId = 0;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         if (resend.generation != generation) return;
         afterId = resend.sentUpToId;
         upToId = resend.upToId;
@@ -129,12 +129,12 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
         deltaQueueStorage->readDeltasInIdRange(afterId, upToId, kResendChunkSize, chunk.rows);
         for (auto& row : chunk.rows) row.delta.clientId = clientId;
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", kResendError, e.what());
+        lv_printLog(LogPriority::kError, "tessarine", kResendError, e.what());
         failed = true;
     }
     std::optional<unsigned> completedCount;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         if (resend.generation != generation) return;  // a newer resend starts over
         if (failed) {
             suspend();
@@ -147,14 +147,15 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
         }
     }
     if (completedCount) {
-        lv_printLog(3, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)", *completedCount);
+        lv_printLog(LogPriority::kDebug, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)",
+                    *completedCount);
     }
 }
 
 void DeltaSender::send(const Next& next) {
     const bool resent = next.kind == Next::Kind::RESEND;
     const bool taken = hand(*syncProtocol, resent ? next.resent->delta : next.live, resent);
-    std::lock_guard<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     // After a newer request, what this send did no longer matters: the new
     // resend carries everything from the start.
     if (resend.generation != next.generation) return;

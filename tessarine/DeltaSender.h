@@ -21,18 +21,19 @@
 // change in order: sending later changes first would let the server see a
 // newer change of an object before an older one.
 //
-// Threads: every operation may be called from any thread. Locks: mutex is a
-// leaf, held only to look at or change the waiting work, never while the
-// transport or the storage is called.
+// Threads: every operation may be called from any thread. Locks: mutex is
+// the last in the store's lock order (README, "How a change flows through
+// the store"), held only to look at or change the waiting work, never while
+// the transport or the storage is called.
 #pragma once
 
 #include <cstdint>
 #include <deque>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
+#include "platform/ThreadAnnotations.h"
 #include "tessarine/DeltaQueueStorage.h"
 #include "tessarine/SyncProtocol.h"
 
@@ -53,7 +54,7 @@ public:
     // A change whose queue row (queueId) has just committed. Callers add in
     // commit order: the local write lock orders them. Never throws: a change
     // that cannot wait here stays queued for the next connection.
-    void addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexcept;
+    void addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexcept TS_EXCLUDES(mutex);
 
     // A new connection: every change committed so far goes out again, oldest
     // first, before anything committed later; a resend under way starts
@@ -61,11 +62,11 @@ public:
     // completes logs how many deltas it handed over (priority 3). Throws what
     // reading the queue throws; then nothing is handed over until the next
     // request.
-    void requestResend();
+    void requestResend() TS_EXCLUDES(mutex);
 
     // Hands over what waits, on the calling thread, unless somebody is
     // already doing so. Never throws.
-    void sendWaiting() noexcept;
+    void sendWaiting() noexcept TS_EXCLUDES(mutex);
 
 private:
     // What a resend has read and not sent yet; the sending thread's own,
@@ -96,22 +97,22 @@ private:
 
     // Chooses the next step; mutex is held. Clears sending when there is
     // nothing left, so that a change added later finds nobody sending.
-    Next takeNext(Chunk& chunk);
-    void readChunk(Chunk& chunk, uint64_t generation);
-    void send(const Next& next);
+    Next takeNext(Chunk& chunk) TS_REQUIRES(mutex);
+    void readChunk(Chunk& chunk, uint64_t generation) TS_EXCLUDES(mutex);
+    void send(const Next& next) TS_EXCLUDES(mutex);
     // Stops handing over until the next resend; mutex is held.
-    void suspend();
+    void suspend() TS_REQUIRES(mutex);
 
     std::shared_ptr<SyncProtocol> syncProtocol;
     std::shared_ptr<DeltaQueueStorage> deltaQueueStorage;
     std::string clientId;
 
-    std::mutex mutex;
-    std::deque<DeltaQueueStorage::QueuedDelta> live;  // committed, not yet handed over
-    Resend resend;
-    int64_t lastCommittedId = 0;
-    bool sending = false;    // a thread is handing over
-    bool suspended = false;  // a send failed; wait for the next connection
+    Mutex mutex;
+    std::deque<DeltaQueueStorage::QueuedDelta> live TS_GUARDED_BY(mutex);  // committed, not yet handed over
+    Resend resend TS_GUARDED_BY(mutex);
+    int64_t lastCommittedId TS_GUARDED_BY(mutex) = 0;
+    bool sending TS_GUARDED_BY(mutex) = false;    // a thread is handing over
+    bool suspended TS_GUARDED_BY(mutex) = false;  // a send failed; wait for the next connection
 };
 
 }  // namespace tessarine

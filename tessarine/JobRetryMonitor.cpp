@@ -14,12 +14,12 @@ long long millisecondsSince(std::chrono::steady_clock::time_point start) {
 
 }  // namespace
 
-JobRetryMonitor::JobRetryMonitor(std::chrono::milliseconds stallThreshold) : stallThreshold(stallThreshold) {}
+JobRetryMonitor::JobRetryMonitor(std::chrono::milliseconds theStallThreshold) : stallThreshold(theStallThreshold) {}
 
 void JobRetryMonitor::attemptFailed(const std::string& error) {
     long long failedFor = 0;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         if (!current.retrying) {
             current.retrying = true;
             current.failingSince = std::chrono::system_clock::now();
@@ -30,26 +30,28 @@ void JobRetryMonitor::attemptFailed(const std::string& error) {
         stallReported = true;
         failedFor = millisecondsSince(failingSinceSteady);
     }
-    lv_printLog(6, "tessarine", "Store stalled: a job has been failing for %lld ms: %s", failedFor, error.c_str());
+    lv_printLog(LogPriority::kError, "tessarine", "Store stalled: a job has been failing for %lld ms: %s",
+                failedFor, error.c_str());
 }
 
 void JobRetryMonitor::jobEnded(bool succeeded) {
     bool reportRecovery = false;
     long long failedFor = 0;
     {
-        std::lock_guard<std::mutex> lock(mutex);
+        MutexLock lock(mutex);
         reportRecovery = succeeded && stallReported;
         if (reportRecovery) failedFor = millisecondsSince(failingSinceSteady);
         current = State();
         stallReported = false;
     }
     if (reportRecovery) {
-        lv_printLog(4, "tessarine", "Store recovered: a job succeeded after failing for %lld ms", failedFor);
+        lv_printLog(LogPriority::kInfo, "tessarine", "Store recovered: a job succeeded after failing for %lld ms",
+                    failedFor);
     }
 }
 
 JobRetryMonitor::State JobRetryMonitor::state() const {
-    std::lock_guard<std::mutex> lock(mutex);
+    MutexLock lock(mutex);
     return current;
 }
 

@@ -18,8 +18,9 @@
 #pragma once
 
 #include <chrono>
-#include <mutex>
 #include <string>
+
+#include "platform/ThreadAnnotations.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -42,10 +43,10 @@ public:
 
 private:
     const std::chrono::milliseconds stallThreshold;
-    mutable std::mutex mutex;
-    State current;
-    std::chrono::steady_clock::time_point failingSinceSteady{};
-    bool stallReported = false;
+    mutable Mutex mutex;
+    State current TS_GUARDED_BY(mutex);
+    std::chrono::steady_clock::time_point failingSinceSteady TS_GUARDED_BY(mutex){};
+    bool stallReported TS_GUARDED_BY(mutex) = false;
 };
 
 }  // namespace tessarine

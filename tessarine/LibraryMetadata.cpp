@@ -2,8 +2,9 @@
 
 #include <chrono>
 #include <cstdio>
-#include <mutex>
 #include <random>
+
+#include "platform/ThreadAnnotations.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -18,9 +19,9 @@ namespace {
 // the Android NDK ships it, takes a device path and fails on that word).
 struct RandomSource {
     RandomSource() : engine(std::random_device()()) {}
-    std::mutex mutex;
-    std::mt19937 engine;
-    std::uniform_int_distribution<uint32_t> distribution{0, 4294967295u};
+    Mutex mutex;
+    std::mt19937 engine TS_GUARDED_BY(mutex);
+    std::uniform_int_distribution<uint32_t> distribution TS_GUARDED_BY(mutex){0, 4294967295u};
 };
 
 RandomSource& processRandomSource() {
@@ -36,7 +37,7 @@ void appendHex8(std::string& text, uint32_t value) {
 
 }  // namespace
 
-LibraryMetadata::LibraryMetadata(std::shared_ptr<LibraryMetadataStorage> storage) : storage(std::move(storage)) {
+LibraryMetadata::LibraryMetadata(std::shared_ptr<LibraryMetadataStorage> theStorage) : storage(std::move(theStorage)) {
     init();
 }
 
@@ -76,7 +77,7 @@ std::string LibraryMetadata::generateClientUuid() {
 
 uint32_t LibraryMetadata::generateRandom32() {
     RandomSource& source = processRandomSource();
-    std::lock_guard<std::mutex> lock(source.mutex);
+    MutexLock lock(source.mutex);
     return source.distribution(source.engine);
 }
 

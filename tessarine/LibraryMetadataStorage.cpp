@@ -13,8 +13,8 @@ const std::string& kTable = LibraryMetadataStorage::TABLE_NAME;
 LibraryMetadataStorage::KeyNotFoundError::KeyNotFoundError(const std::string& key)
     : std::runtime_error("Key not found: \"" + key + "\"") {}
 
-LibraryMetadataStorage::LibraryMetadataStorage(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {
+LibraryMetadataStorage::LibraryMetadataStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {
     createDbTableIfNecessary();
 }
 

@@ -10,15 +10,15 @@ namespace tessarine {
 Lifecycle::~Lifecycle() = default;
 
 void Lifecycle::stop() {
-    std::lock_guard<std::mutex> lock(callbacksMutex);
+    MutexLock lock(callbacksMutex);
     for (const auto& entry : stopCallbacks) entry.second();
 }
 
 int Lifecycle::addStopCallback(std::function<void()> callback) {
-    std::lock_guard<std::mutex> lock(callbacksMutex);
+    MutexLock lock(callbacksMutex);
     int id;
     {
-        std::lock_guard<std::mutex> idLock(idMutex);
+        MutexLock idLock(idMutex);
         if (lastCallbackId == INT_MAX) throw std::runtime_error("Lifecycle has no stop callback ids left");
         id = ++lastCallbackId;
     }
@@ -27,7 +27,7 @@ int Lifecycle::addStopCallback(std::function<void()> callback) {
 }
 
 void Lifecycle::removeStopCallback(int id) {
-    std::lock_guard<std::mutex> lock(callbacksMutex);
+    MutexLock lock(callbacksMutex);
     stopCallbacks.erase(std::remove_if(stopCallbacks.begin(), stopCallbacks.end(),
                                        [id](const auto& entry) { return entry.first == id; }),
                         stopCallbacks.end());

@@ -10,13 +10,15 @@
 // Threads: any thread may call every operation. stop() holds the registry
 // lock while the callbacks run, so a callback must not add, remove or stop
 // on the same Lifecycle; a registration from another thread during stop()
-// waits until the callbacks have run. Lock order: callbacksMutex, idMutex.
+// waits until the callbacks have run. Lock order: the README's ("How a
+// change flows through the store"); idMutex is a leaf.
 #pragma once
 
 #include <functional>
-#include <mutex>
 #include <utility>
 #include <vector>
+
+#include "platform/ThreadAnnotations.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -29,10 +31,10 @@ public:
     virtual void removeStopCallback(int id);
 
 private:
-    std::vector<std::pair<int, std::function<void()>>> stopCallbacks;
-    int lastCallbackId = 0;
-    std::mutex callbacksMutex;
-    std::mutex idMutex;
+    Mutex callbacksMutex;
+    Mutex idMutex TS_ACQUIRED_AFTER(callbacksMutex);
+    std::vector<std::pair<int, std::function<void()>>> stopCallbacks TS_GUARDED_BY(callbacksMutex);
+    int lastCallbackId TS_GUARDED_BY(idMutex) = 0;
 };
 
 }  // namespace tessarine

@@ -14,13 +14,12 @@ namespace protocol {
 namespace {
 
 constexpr const char* kTag = "tessarine";
-constexpr int kErrorPriority = 6;
 constexpr flatbuffers::uoffset_t kMaxDepth = 64;
 constexpr flatbuffers::uoffset_t kMaxTables = 1000000;
 constexpr size_t kInitialBuilderSize = 1024;
 
 [[noreturn]] void rejectBuffer(const char* logLine, const char* message) {
-    lv_printLog(kErrorPriority, kTag, "%s", logLine);
+    lv_printLog(LogPriority::kError, kTag, "%s", logLine);
     throw std::runtime_error(message);
 }
 

@@ -20,10 +20,10 @@ constexpr std::chrono::milliseconds kIdleWait(4294967295LL);
 
 }  // namespace
 
-SerializedJobQueue::SerializedJobQueue(std::shared_ptr<ThreadCreator> threadCreator,
-                                       ExponentialBackoff<std::chrono::milliseconds> backoff,
+SerializedJobQueue::SerializedJobQueue(std::shared_ptr<ThreadCreator> theThreadCreator,
+                                       ExponentialBackoff<std::chrono::milliseconds> theBackoff,
                                        std::chrono::milliseconds stallThreshold)
-    : jobs(-1), threadCreator(std::move(threadCreator)), backoff(backoff), retryMonitor(stallThreshold) {
+    : jobs(-1), threadCreator(std::move(theThreadCreator)), backoff(theBackoff), retryMonitor(stallThreshold) {
     if (!this->threadCreator) throw std::runtime_error("SerializedJobQueue needs a ThreadCreator");
     if (!this->backoff.isValid()) throw std::runtime_error("SerializedJobQueue: invalid back-off");
     std::thread thread = this->threadCreator->createThread([this] { mainLoop(); });
@@ -45,14 +45,14 @@ void SerializedJobQueue::stopProcessingJobs() {
     {
         // Under sleepMutex, so that a worker about to pause either sees the
         // flag already cleared or is already waiting when the notice comes.
-        std::lock_guard<std::mutex> sleepLock(sleepMutex);
+        MutexLock sleepLock(sleepMutex);
         running = false;
     }
-    sleepCondition.notify_all();
+    sleepCondition.notifyAll();
     // The worker checks the flag under jobMutex before every attempt, so
     // once the flag is clear no attempt starts; taking the mutex waits for
     // the one that may be running.
-    std::lock_guard<std::mutex> jobLock(jobMutex);
+    MutexLock jobLock(jobMutex);
 }
 
 void SerializedJobQueue::addJob(Job job) {
@@ -61,7 +61,7 @@ void SerializedJobQueue::addJob(Job job) {
 }
 
 std::size_t SerializedJobQueue::getWaitingJobCount() {
-    auto lock = jobs.lock();
+    MutexLock lock(jobs.mutex());
     return jobs.sizeNoLock();
 }
 
@@ -70,8 +70,8 @@ JobRetryMonitor::State SerializedJobQueue::getRetryState() const { return retryM
 void SerializedJobQueue::mainLoop() {
     while (running) {
         {
-            auto lock = jobs.lock();
-            jobs.waitUntilNotEmpty(lock, std::chrono::system_clock::now() + kIdleWait);
+            MutexLock lock(jobs.mutex());
+            jobs.waitUntilNotEmpty(std::chrono::system_clock::now() + kIdleWait);
         }
         consumeQueue();
     }
@@ -81,13 +81,13 @@ void SerializedJobQueue::consumeQueue() {
     while (running) {
         Job job;
         {
-            auto lock = jobs.lock();
+            MutexLock lock(jobs.mutex());
             if (!jobs.isNotEmptyNoLock()) return;
             // The job stays at the front while it runs.
             job = jobs.frontNoLock();
         }
         retryUntilSucceeds(job);
-        auto lock = jobs.lock();
+        MutexLock lock(jobs.mutex());
         if (jobs.isNotEmptyNoLock()) jobs.popFrontNoLock();
     }
 }
@@ -97,7 +97,7 @@ void SerializedJobQueue::retryUntilSucceeds(const Job& job) {
     while (true) {
         std::optional<std::string> failure;
         {
-            std::lock_guard<std::mutex> jobLock(jobMutex);
+            MutexLock jobLock(jobMutex);
             if (!running) break;  // the job is abandoned
             failure = attempt(job);
         }
@@ -120,15 +120,18 @@ std::optional<std::string> SerializedJobQueue::attempt(const Job& job) {
     } catch (const std::exception& e) {
         return std::string(e.what());  // the job has logged what went wrong
     } catch (...) {
-        lv_printLog(6, "tessarine", "Job failed with an exception not derived from std::exception; retrying");
+        lv_printLog(LogPriority::kError, "tessarine",
+                    "Job failed with an exception not derived from std::exception; retrying");
         return std::string("an exception not derived from std::exception");
     }
 }
 
 void SerializedJobQueue::interruptableSleep(std::chrono::milliseconds delay) {
     auto deadline = std::chrono::system_clock::now() + delay;
-    std::unique_lock<std::mutex> lock(sleepMutex);
-    sleepCondition.wait_until(lock, deadline, [this] { return !running; });
+    MutexLock lock(sleepMutex);
+    while (running) {
+        if (!sleepCondition.waitUntil(sleepMutex, deadline)) return;
+    }
 }
 
 }  // namespace tessarine

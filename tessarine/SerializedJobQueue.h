@@ -36,16 +36,15 @@
 
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <cstddef>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <thread>
 
 #include "concurrency/SharedQueue.h"
+#include "platform/ThreadAnnotations.h"
 #include "tessarine/ExponentialBackoff.h"
 #include "tessarine/JobRetryMonitor.h"
 #include "tessarine/ThreadCreator.h"
@@ -81,7 +80,7 @@ public:
 
     // Stops all processing and returns once an attempt in progress has ended.
     // Later calls change nothing.
-    virtual void stopProcessingJobs();
+    virtual void stopProcessingJobs() TS_EXCLUDES(jobMutex, sleepMutex);
 
     // Appends a copy of job; also after a stop, when it will never run.
     // Throws std::runtime_error for a job with an empty function (it could
@@ -100,18 +99,18 @@ private:
     void consumeQueue();
     void retryUntilSucceeds(const Job& job);
     // Runs one attempt; the error message of a failure, empty on success.
-    std::optional<std::string> attempt(const Job& job);
-    void interruptableSleep(std::chrono::milliseconds delay);
+    std::optional<std::string> attempt(const Job& job) TS_REQUIRES(jobMutex);
+    void interruptableSleep(std::chrono::milliseconds delay) TS_EXCLUDES(sleepMutex);
 
     concurrency::SharedQueue<Job, concurrency::defaultCost> jobs;
     std::shared_ptr<ThreadCreator> threadCreator;
-    std::condition_variable sleepCondition;
+    CondVar sleepCondition;
     std::thread worker;
     ExponentialBackoff<std::chrono::milliseconds> backoff;  // worker only
     // Cleared by stopProcessingJobs under sleepMutex; read anywhere.
     std::atomic<bool> running{true};
-    std::mutex jobMutex;
-    std::mutex sleepMutex;
+    Mutex jobMutex;  // held by the worker for each attempt
+    Mutex sleepMutex;
     JobRetryMonitor retryMonitor;
 };
 

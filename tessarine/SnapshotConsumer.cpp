@@ -9,12 +9,12 @@
 namespace lumivale {
 namespace tessarine {
 
-SnapshotConsumer::SnapshotConsumer(std::shared_ptr<DeltaQueueStorage> deltaQueueStorage,
-                                   std::shared_ptr<SyncProtocol> syncProtocol,
-                                   std::shared_ptr<SubscriptionManager> subscriptionManager)
-    : deltaQueueStorage(std::move(deltaQueueStorage)),
-      syncProtocol(std::move(syncProtocol)),
-      subscriptionManager(std::move(subscriptionManager)) {
+SnapshotConsumer::SnapshotConsumer(std::shared_ptr<DeltaQueueStorage> theDeltaQueueStorage,
+                                   std::shared_ptr<SyncProtocol> theSyncProtocol,
+                                   std::shared_ptr<SubscriptionManager> theSubscriptionManager)
+    : deltaQueueStorage(std::move(theDeltaQueueStorage)),
+      syncProtocol(std::move(theSyncProtocol)),
+      subscriptionManager(std::move(theSubscriptionManager)) {
     snapshotReceivedCallbackId = this->syncProtocol->addSnapshotReceivedCallback(
         [this](const SyncProtocol::Snapshot& snapshot) { onSnapshotReceived(snapshot); });
 }
@@ -41,7 +41,7 @@ void SnapshotConsumer::onSnapshotReceived(const SyncProtocol::Snapshot& snapshot
         }
         syncProtocol->triggerDeltaReceivedCallbacks(deltas);
     } catch (const std::exception& e) {
-        lv_printLog(6, "tessarine", "Error while processing snapshot: %s", e.what());
+        lv_printLog(LogPriority::kError, "tessarine", "Error while processing snapshot: %s", e.what());
         throw;
     }
 }

@@ -11,14 +11,14 @@
 namespace lumivale {
 namespace tessarine {
 
-SnapshotGenerator::SnapshotGenerator(std::shared_ptr<lumivale::sqlite::Database> database,
-                                     std::shared_ptr<CollectionStorage> collectionStorage,
-                                     std::shared_ptr<SubscriptionManager> subscriptionManager,
-                                     std::shared_ptr<VersionVectorStorage> versionVectorStorage)
-    : database(std::move(database)),
-      collectionStorage(std::move(collectionStorage)),
-      subscriptionManager(std::move(subscriptionManager)),
-      versionVectorStorage(std::move(versionVectorStorage)) {}
+SnapshotGenerator::SnapshotGenerator(std::shared_ptr<lumivale::sqlite::Database> theDatabase,
+                                     std::shared_ptr<CollectionStorage> theCollectionStorage,
+                                     std::shared_ptr<SubscriptionManager> theSubscriptionManager,
+                                     std::shared_ptr<VersionVectorStorage> theVersionVectorStorage)
+    : database(std::move(theDatabase)),
+      collectionStorage(std::move(theCollectionStorage)),
+      subscriptionManager(std::move(theSubscriptionManager)),
+      versionVectorStorage(std::move(theVersionVectorStorage)) {}
 
 SnapshotGenerator::~SnapshotGenerator() = default;
 

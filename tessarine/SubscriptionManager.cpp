@@ -10,12 +10,12 @@ namespace lumivale {
 namespace tessarine {
 
 SubscriptionManager::SubscriptionManager(std::shared_ptr<lumivale::sqlite::Database> /*database*/,
-                                         std::shared_ptr<SyncProtocol> syncProtocol,
-                                         std::shared_ptr<SubscriptionStorage> subscriptionStorage,
-                                         std::shared_ptr<LibraryMetadata> libraryMetadata)
-    : syncProtocol(std::move(syncProtocol)),
-      subscriptionStorage(std::move(subscriptionStorage)),
-      libraryMetadata(std::move(libraryMetadata)) {
+                                         std::shared_ptr<SyncProtocol> theSyncProtocol,
+                                         std::shared_ptr<SubscriptionStorage> theSubscriptionStorage,
+                                         std::shared_ptr<LibraryMetadata> theLibraryMetadata)
+    : syncProtocol(std::move(theSyncProtocol)),
+      subscriptionStorage(std::move(theSubscriptionStorage)),
+      libraryMetadata(std::move(theLibraryMetadata)) {
     connectionEstablishedCallbackId =
         this->syncProtocol->addConnectionEstablishedCallback([this] { onConnectionEstablished(); });
     subscriptionResponseCallbackId = this->syncProtocol->addSubscriptionResponseReceivedCallback(
@@ -51,7 +51,7 @@ uint64_t SubscriptionManager::getSequenceNumber(const std::string& collectionNam
 }
 
 void SubscriptionManager::onConnectionEstablished() {
-    lv_printLog(3, "tessarine", "SubscriptionManager::onConnectionEstablished is called back");
+    lv_printLog(LogPriority::kDebug, "tessarine", "SubscriptionManager::onConnectionEstablished is called back");
     try {
         for (const Subscription& subscription : subscriptionStorage->getSubscriptions()) {
             sendSubscribeCollectionRequest(subscription.collectionName, subscription.sequenceNumber);

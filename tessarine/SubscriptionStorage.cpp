@@ -7,8 +7,8 @@
 namespace lumivale {
 namespace tessarine {
 
-SubscriptionStorage::SubscriptionStorage(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {
+SubscriptionStorage::SubscriptionStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {
     createDbTableIfNecessary();
 }
 
@@ -37,12 +37,12 @@ uint64_t SubscriptionStorage::getSequenceNumber(const std::string& collectionNam
     auto statement = database->prepare("SELECT seq_num FROM " + getTableName() + " WHERE collection_name = ?");
     statement.bind(1, collectionName);
     if (!statement.step()) throw std::runtime_error("Failed to get sequence number for collection");
-    return static_cast<uint64_t>(statement(0).getInt64());
+    return statement(0).getUint64();
 }
 
 void SubscriptionStorage::updateSequenceNumber(const std::string& collectionName, uint64_t sequenceNumber) {
     auto statement = database->prepare("UPDATE " + getTableName() + " SET seq_num = ? WHERE collection_name = ?");
-    statement.bind(1, static_cast<long long>(sequenceNumber));
+    statement.bind(1, sequenceNumber);
     statement.bind(2, collectionName);
     statement.step();
 }
@@ -51,7 +51,7 @@ std::vector<Subscription> SubscriptionStorage::getSubscriptions() {
     auto statement = database->prepare("SELECT collection_name, seq_num FROM " + getTableName());
     std::vector<Subscription> result;
     while (statement.step()) {
-        result.push_back({statement(0).getText(), static_cast<uint64_t>(statement(1).getInt64())});
+        result.push_back({statement(0).getText(), statement(1).getUint64()});
     }
     return result;
 }

@@ -7,12 +7,12 @@
 namespace lumivale {
 namespace tessarine {
 
-SyncMetricsCollector::SyncMetricsCollector(std::shared_ptr<SyncProtocol> syncProtocol,
-                                           std::shared_ptr<DeltaQueueStorage> deltaQueueStorage,
-                                           std::shared_ptr<SerializedJobQueue> serializedJobQueue)
-    : syncProtocol(std::move(syncProtocol)),
-      deltaQueueStorage(std::move(deltaQueueStorage)),
-      serializedJobQueue(std::move(serializedJobQueue)) {
+SyncMetricsCollector::SyncMetricsCollector(std::shared_ptr<SyncProtocol> theSyncProtocol,
+                                           std::shared_ptr<DeltaQueueStorage> theDeltaQueueStorage,
+                                           std::shared_ptr<SerializedJobQueue> theSerializedJobQueue)
+    : syncProtocol(std::move(theSyncProtocol)),
+      deltaQueueStorage(std::move(theDeltaQueueStorage)),
+      serializedJobQueue(std::move(theSerializedJobQueue)) {
     connectionCallbackId = this->syncProtocol->addConnectionEstablishedCallback([this] { ++connections; });
 }
 

@@ -10,10 +10,10 @@ namespace tessarine {
 template <typename... Args>
 int SyncProtocol::CallbackRegistry<Args...>::add(const Callback& callback) {
     Callback copy = callback;
-    std::lock_guard<std::mutex> listLock(listMutex);
+    MutexLock listLock(listMutex);
     int id;
     {
-        std::lock_guard<std::mutex> idLock(idMutex);
+        MutexLock idLock(idMutex);
         if (lastId == INT_MAX) throw std::runtime_error("SyncProtocol callback registry has no ids left");
         id = ++lastId;
     }
@@ -23,7 +23,7 @@ int SyncProtocol::CallbackRegistry<Args...>::add(const Callback& callback) {
 
 template <typename... Args>
 void SyncProtocol::CallbackRegistry<Args...>::remove(int id) {
-    std::lock_guard<std::mutex> listLock(listMutex);
+    MutexLock listLock(listMutex);
     entries.erase(std::remove_if(entries.begin(), entries.end(),
                                  [id](const std::pair<int, Callback>& entry) { return entry.first == id; }),
                   entries.end());
@@ -33,7 +33,7 @@ template <typename... Args>
 void SyncProtocol::CallbackRegistry<Args...>::deliver(Args... args) {
     // The list lock stays held while the callbacks run, so that a removal
     // cannot return while a removed callback is still running.
-    std::lock_guard<std::mutex> listLock(listMutex);
+    MutexLock listLock(listMutex);
     for (const auto& entry : entries) entry.second(args...);
 }
 

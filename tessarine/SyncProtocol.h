@@ -35,10 +35,11 @@
 
 #include <cstdint>
 #include <functional>
-#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
+
+#include "platform/ThreadAnnotations.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -164,8 +165,8 @@ public:
     void removeSnapshotReceivedCallback(int id);
 
 private:
-    // The callbacks of one kind of event with their ids. Lock order:
-    // listMutex, then idMutex. Its operations are defined in SyncProtocol.cpp,
+    // The callbacks of one kind of event with their ids; idMutex is a leaf
+    // taken under listMutex (the store's lock order is in the README). Its operations are defined in SyncProtocol.cpp,
     // the only place that uses them.
     template <typename... Args>
     class CallbackRegistry {
@@ -177,10 +178,10 @@ private:
         void deliver(Args... args);
 
     private:
-        std::vector<std::pair<int, Callback>> entries;
-        int lastId = 0;
-        std::mutex listMutex;
-        std::mutex idMutex;
+        Mutex listMutex;
+        Mutex idMutex TS_ACQUIRED_AFTER(listMutex);
+        std::vector<std::pair<int, Callback>> entries TS_GUARDED_BY(listMutex);
+        int lastId TS_GUARDED_BY(idMutex) = 0;
     };
 
     CallbackRegistry<> connectionEstablishedCallbacks;

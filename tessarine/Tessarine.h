@@ -30,6 +30,7 @@
 
 #include "tessarine/CallbackManager.h"
 #include "tessarine/Collection.h"
+#include "tessarine/StoreComponents.h"
 #include "tessarine/SyncMetrics.h"
 #include "tessarine/SyncProtocol.h"
 #include "tessarine/ThreadCreator.h"
@@ -40,18 +41,6 @@ class Database;
 }
 
 namespace tessarine {
-
-class DeltaHandler;
-class DeltaQueue;
-class DeltaQueueStorage;
-class Lifecycle;
-class SnapshotConsumer;
-class SnapshotGenerator;
-class SubscriptionManager;
-class SubscriptionStorage;
-class SyncMetricsCollector;
-class VersionIdGenerator;
-class VersionVectorStorage;
 
 // The pragmas a store database is opened with. The defaults are the store's
 // fixed tuning; applications do not choose other values.
@@ -69,13 +58,11 @@ public:
     static std::unique_ptr<Tessarine> open(const std::string& path, std::shared_ptr<SyncProtocol> syncProtocol,
                                            std::shared_ptr<ThreadCreator> threadCreator) noexcept;
 
-    // Builds every component in order on the given storages (open does this
-    // for you). Throws when a component cannot be built or a pointer is null.
+    // Builds every component on database (open does this for you); path
+    // names its file for remove(). Throws when a component cannot be built
+    // or a pointer is null.
     Tessarine(std::shared_ptr<SyncProtocol> syncProtocol, std::shared_ptr<ThreadCreator> threadCreator,
-              std::shared_ptr<lumivale::sqlite::Database> database,
-              std::shared_ptr<VersionVectorStorage> versionVectorStorage,
-              std::shared_ptr<SubscriptionStorage> subscriptionStorage,
-              std::shared_ptr<DeltaQueueStorage> deltaQueueStorage, const std::string& path);
+              std::shared_ptr<lumivale::sqlite::Database> database, const std::string& path);
     ~Tessarine();
     Tessarine(const Tessarine&) = delete;
     Tessarine& operator=(const Tessarine&) = delete;
@@ -123,19 +110,7 @@ public:
 private:
     std::shared_ptr<SyncProtocol> syncProtocol;
     std::shared_ptr<ThreadCreator> threadCreator;
-    std::shared_ptr<lumivale::sqlite::Database> database;
-    std::shared_ptr<VersionVectorStorage> versionVectorStorage;
-    std::shared_ptr<SubscriptionManager> subscriptionManager;
-    std::shared_ptr<VersionIdGenerator> versionIdGenerator;
-    std::shared_ptr<CollectionStorage> collectionStorage;
-    std::shared_ptr<CallbackManager> callbackManager;
-    std::shared_ptr<DeltaHandler> deltaHandler;
-    std::shared_ptr<DeltaQueue> deltaQueue;
-    std::shared_ptr<Lifecycle> lifecycle;
-    std::shared_ptr<SnapshotGenerator> snapshotGenerator;
-    std::shared_ptr<SnapshotConsumer> snapshotConsumer;
-    std::shared_ptr<SyncMetricsCollector> syncMetrics;
-    std::string clientId;
+    StoreComponents components;
     std::string path;
 };
 

@@ -8,6 +8,9 @@
 // when body returns; it may throw instead, but then it must not have started
 // body. The store joins the thread; it never detaches it. createThread is
 // called once per store, from the thread that opens the store.
+//
+// StdThreadCreator is the ready-made creator for applications that need
+// nothing special: it starts a plain std::thread.
 #pragma once
 
 #include <functional>
@@ -17,4 +20,9 @@ class ThreadCreator {
 public:
     virtual ~ThreadCreator();
     virtual std::thread createThread(std::function<void()> body) = 0;
+};
+
+class StdThreadCreator : public ThreadCreator {
+public:
+    std::thread createThread(std::function<void()> body) override;
 };

@@ -8,8 +8,8 @@
 namespace lumivale {
 namespace tessarine {
 
-VersionIdGenerator::VersionIdGenerator(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {
+VersionIdGenerator::VersionIdGenerator(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {
     createVersionIdTable();
 }
 
@@ -47,7 +47,7 @@ uint64_t VersionIdGenerator::queryVersionId(const std::string& collectionName) {
     statement.bind(1, collectionName);
     if (!statement.step()) return 0;
     // The column holds an unsigned 64-bit counter in SQLite's signed integer.
-    return static_cast<uint64_t>(statement(0).getInt64());
+    return statement(0).getUint64();
 }
 
 }  // namespace tessarine

@@ -5,8 +5,8 @@
 namespace lumivale {
 namespace tessarine {
 
-VersionVectorStorage::VersionVectorStorage(std::shared_ptr<lumivale::sqlite::Database> database)
-    : database(std::move(database)) {
+VersionVectorStorage::VersionVectorStorage(std::shared_ptr<lumivale::sqlite::Database> theDatabase)
+    : database(std::move(theDatabase)) {
     this->database->exec("CREATE TABLE IF NOT EXISTS " + getTableName() +
                          " (collection_name VARCHAR(256),client_id VARCHAR(128),version_id UNSIGNED BIG INT,"
                          "PRIMARY KEY (collection_name, client_id))");
@@ -25,7 +25,7 @@ void VersionVectorStorage::updateCollectionVersionVector(const std::string& coll
                                        " (collection_name, client_id, version_id) VALUES (?, ?, ?)");
     statement.bind(1, collectionName);
     statement.bind(2, clientId);
-    statement.bind(3, static_cast<long long>(versionId));
+    statement.bind(3, versionId);
     statement.step();
 }
 
@@ -34,7 +34,7 @@ uint64_t VersionVectorStorage::getCollectionVersion(const std::string& collectio
                                        " WHERE collection_name = ? AND client_id = ?");
     statement.bind(1, collectionName);
     statement.bind(2, clientId);
-    return statement.step() ? static_cast<uint64_t>(statement(0).getInt64()) : 0;
+    return statement.step() ? statement(0).getUint64() : 0;
 }
 
 }  // namespace tessarine

@@ -19,6 +19,7 @@
 #include "tessarine/CollectionStorageQueries.h"
 #include "tessarine/VersionIdGenerator.h"
 
+using lumivale::sqlite::kOpenReadWriteCreate;
 using lumivale::sqlite::Database;
 using namespace lumivale::tessarine;
 using Status = CollectionStorage::ObjectStatus;
@@ -78,7 +79,7 @@ protected:
     }
 
     testsupport::TempDir dir;
-    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("store.db"), 6);
+    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("store.db"), kOpenReadWriteCreate);
     std::shared_ptr<CallbackManager> callbacks = std::make_shared<CallbackManager>();
     std::shared_ptr<CollectionStorage> storage = std::make_shared<CollectionStorage>(
         db, callbacks, std::make_shared<CollectionIndexStorage>(db), std::make_shared<CollectionObjectStorage>(db),

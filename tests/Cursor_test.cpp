@@ -7,6 +7,7 @@
 #include "sqlite/Database.h"
 #include "tessarine/Cursor.h"
 
+using lumivale::sqlite::kOpenReadWriteCreate;
 using lumivale::sqlite::Database;
 using lumivale::tessarine::Cursor;
 
@@ -31,7 +32,7 @@ protected:
     }
 
     testsupport::TempDir dir;
-    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("cursor.db"), 6);
+    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("cursor.db"), kOpenReadWriteCreate);
 };
 
 TEST_F(CursorTest, ReadsFieldsFromTheirColumnsRepeatedlyAndKeepsReportingTheEndOrAnError) {

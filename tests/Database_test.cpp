@@ -12,6 +12,7 @@
 #include "sqlite/SQLiteException.h"
 #include "sqlite/StatementCache.h"
 
+using lumivale::sqlite::kOpenReadWriteCreate;
 using lumivale::sqlite::Database;
 using lumivale::sqlite::SQLiteException;
 using lumivale::sqlite::Statement;
@@ -23,7 +24,7 @@ constexpr auto kImmediate = Database::TransactionType::Immediate;
 class DatabaseTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        db = std::make_shared<Database>(dir.file("db.sqlite"), 6);
+        db = std::make_shared<Database>(dir.file("db.sqlite"), kOpenReadWriteCreate);
         db->exec("PRAGMA journal_mode=WAL");
         db->exec("CREATE TABLE t (k TEXT PRIMARY KEY, v BLOB)");
     }
@@ -281,7 +282,7 @@ TEST_F(DatabaseTest, ErrorsCarrySqliteMessageAndStatement) {
         EXPECT_NE(std::string::npos, std::string(e.what()).find("INSERT INTO t")) << e.what();
     }
     EXPECT_THROW(db->exec("DROP TABLE missing"), SQLiteException);
-    EXPECT_THROW(Database(dir.file("no/such/dir/db.sqlite"), 6), SQLiteException);
+    EXPECT_THROW(Database(dir.file("no/such/dir/db.sqlite"), kOpenReadWriteCreate), SQLiteException);
     // A failed statement inside a transaction rolls back the whole of it.
     EXPECT_THROW(db->runInTransaction([&] {
         insert("new");

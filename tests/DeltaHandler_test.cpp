@@ -167,10 +167,9 @@ TEST_F(DeltaHandlerTest, StatusOfLocallyDeletedObjectWritesNoRowButIsReported) {
     localSave("a:b", "k");
     Delta remove;
     remove.collectionName = "a:b";
-    remove.versionId = collectionStorage->incrementAndGetVersionId("a:b");
     remove.type = ts::SyncProtocol::DeltaType::DELETE;
     remove.primaryKey = "k";
-    deltaHandler->addLocalDelta(remove);
+    remove.versionId = deltaHandler->addLocalDeltaWithNextVersionId(remove);
     report(remove, Status::SENT);
     EXPECT_EQ(0, object("a:b", "k").first);
     EXPECT_EQ(Status::SENT, receivedDeltas().back().status);

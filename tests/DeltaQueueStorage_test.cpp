@@ -5,6 +5,7 @@
 #include "tessarine/DeltaQueueStorage.h"
 #include "tessarine/Tessarine.h"
 
+using lumivale::sqlite::kOpenReadWriteCreate;
 using lumivale::sqlite::Database;
 using lumivale::tessarine::DeltaQueueStorage;
 using lumivale::tessarine::SyncProtocol;
@@ -132,7 +133,7 @@ TEST_F(DeltaQueueStorageTest, SchemaAndIndexNamesAreExact) {
 }
 
 TEST(DeltaQueueStorageDeathTest, StoringPersistedIsABrokenInvariant) {
-    auto db = std::make_shared<Database>(":memory:", 6);
+    auto db = std::make_shared<Database>(":memory:", kOpenReadWriteCreate);
     DeltaQueueStorage storage(db);
     EXPECT_DEATH(storage.updateDeltaStatus(makeDelta("a:b", 1, "k"), Status::PERSISTED),
                  "Assert \\(DeltaQueueStorage:[0-9]+\\): Deltas with status=PERSISTED should be deleted from the queue");

@@ -144,8 +144,8 @@ TEST_F(DeltaQueueTest, ThrowingListenerFailsJobButCommittedChangeIsNotRepeated) 
 class FlakyDeltaQueueTest : public DeltaQueueTest {
 protected:
     void SetUp() override {
-        db = ts::Tessarine::createSqliteDatabase(path, {});
-        flaky = std::make_shared<FlakyDeltaQueueStorage>(db, 2);
+        database = ts::Tessarine::createSqliteDatabase(path, {});
+        flaky = std::make_shared<FlakyDeltaQueueStorage>(database, 2);
         deltaQueueStorage = flaky;
         build();
     }

@@ -1,6 +1,6 @@
 // A transport for tests: records what the store sends, lets a test fire the
 // transport's events, and can be told to fail. Thread-safe. Also a
-// ThreadCreator that starts plain threads and counts them.
+// StdThreadCreator that counts the threads it starts.
 #pragma once
 
 #include <atomic>
@@ -93,11 +93,11 @@ private:
     std::function<void(const Delta&)> onSend;
 };
 
-class CountingThreadCreator : public ThreadCreator {
+class CountingThreadCreator : public StdThreadCreator {
 public:
     std::thread createThread(std::function<void()> body) override {
         ++created;
-        return std::thread(std::move(body));
+        return StdThreadCreator::createThread(std::move(body));
     }
     std::atomic<int> created{0};
 };

@@ -14,6 +14,8 @@
 #include "tools/JsonWriter.h"
 #include "tools/StoreInspector.h"
 
+using lumivale::sqlite::kOpenReadWriteCreate;
+
 namespace {
 
 namespace ts = lumivale::tessarine;
@@ -153,7 +155,7 @@ TEST(InspectorTest, FilesThatCannotBeInspectedGetAClearMessageAndANonZeroExit) {
     const std::string store = dir.file("store.db");
     buildStore(store);
     std::ofstream(dir.file("text.db")) << "this is not a database file, just some text that is long enough";
-    lumivale::sqlite::Database(dir.file("other.db"), 6).exec("CREATE TABLE unrelated (x)");
+    lumivale::sqlite::Database(dir.file("other.db"), kOpenReadWriteCreate).exec("CREATE TABLE unrelated (x)");
     struct Case {
         std::vector<std::string> arguments;
         int status;
@@ -161,7 +163,7 @@ TEST(InspectorTest, FilesThatCannotBeInspectedGetAClearMessageAndANonZeroExit) {
     };
     // Another connection that keeps the store to itself (exclusive locking
     // mode, holding its write lock) for the locked case.
-    auto holder = std::make_unique<lumivale::sqlite::Database>(store, 6);
+    auto holder = std::make_unique<lumivale::sqlite::Database>(store, kOpenReadWriteCreate);
     holder->exec("PRAGMA locking_mode=EXCLUSIVE");
     holder->exec("BEGIN EXCLUSIVE");
     holder->exec("CREATE TABLE held (x)");

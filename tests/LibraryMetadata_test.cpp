@@ -8,6 +8,8 @@
 #include "tessarine/LibraryMetadata.h"
 #include "tessarine/Tessarine.h"
 
+using lumivale::sqlite::kOpenReadWriteCreate;
+
 using lumivale::tessarine::LibraryMetadata;
 using lumivale::tessarine::LibraryMetadataStorage;
 using lumivale::tessarine::Tessarine;
@@ -52,13 +54,14 @@ TEST(LibraryMetadataTest, FreshDatabaseGetsTimestampedIdThatReopeningKeeps) {
 }
 
 TEST(LibraryMetadataTest, RandomFieldsArePaddedHexOfTheDraws) {
-    auto storage = std::make_shared<LibraryMetadataStorage>(std::make_shared<lumivale::sqlite::Database>(":memory:", 6));
+    auto storage = std::make_shared<LibraryMetadataStorage>(
+        std::make_shared<lumivale::sqlite::Database>(":memory:", kOpenReadWriteCreate));
     FixedRandomMetadata metadata(storage);
     EXPECT_EQ("0000000000000001000000FF", metadata.generateClientUuid().substr(8));
 }
 
 TEST(LibraryMetadataTest, StoredVersionDecidesUpdateAndExistingRowsAreNeverReplaced) {
-    auto db = std::make_shared<lumivale::sqlite::Database>(":memory:", 6);
+    auto db = std::make_shared<lumivale::sqlite::Database>(":memory:", kOpenReadWriteCreate);
     auto storage = std::make_shared<LibraryMetadataStorage>(db);
     try {
         storage->getString("version");

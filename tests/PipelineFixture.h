@@ -1,11 +1,13 @@
-// The store's components wired together as the store instance wires them,
-// on a database file in a fresh temporary directory, with a FakeTransport.
+// The store's components, wired by the store's own buildStoreComponents, on
+// a database file in a fresh temporary directory, with a FakeTransport.
 // Tests reach every component directly.
 #pragma once
 
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <memory>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -13,19 +15,16 @@
 #include "TestSupport.h"
 #include "sqlite/Database.h"
 #include "tessarine/CallbackManager.h"
-#include "tessarine/CollectionIndexStorage.h"
-#include "tessarine/CollectionObjectStorage.h"
 #include "tessarine/CollectionStorage.h"
 #include "tessarine/Cursor.h"
 #include "tessarine/DeltaHandler.h"
 #include "tessarine/DeltaQueue.h"
 #include "tessarine/DeltaQueueStorage.h"
-#include "tessarine/LibraryMetadata.h"
 #include "tessarine/Lifecycle.h"
 #include "tessarine/SerializedJobQueue.h"
 #include "tessarine/SnapshotConsumer.h"
+#include "tessarine/StoreComponents.h"
 #include "tessarine/SubscriptionManager.h"
-#include "tessarine/SubscriptionStorage.h"
 #include "tessarine/Tessarine.h"
 #include "tessarine/VersionIdGenerator.h"
 #include "tessarine/VersionVectorStorage.h"
@@ -34,36 +33,21 @@ namespace testsupport {
 
 namespace ts = lumivale::tessarine;
 
-class PipelineFixture : public ::testing::Test {
+// The components are the fixture's own members (database, deltaHandler,
+// jobQueue, ...), built by the store's own wiring.
+class PipelineFixture : public ::testing::Test, protected ts::StoreComponents {
 protected:
     using Delta = ts::SyncProtocol::Delta;
     using Status = ts::SyncProtocol::DeltaStatus;
 
-    // Builds every component; a test that needs a special storage sets db
-    // and deltaQueueStorage before calling it.
+    // Builds every component; a test that needs a special storage sets
+    // database and deltaQueueStorage before calling it. The worker retries a
+    // failing job after 1 to 20 ms instead of the store's longer pauses.
     void build() {
-        if (!db) db = ts::Tessarine::createSqliteDatabase(path, {});
-        versionVectorStorage = std::make_shared<ts::VersionVectorStorage>(db);
-        subscriptionStorage = std::make_shared<ts::SubscriptionStorage>(db);
-        if (!deltaQueueStorage) deltaQueueStorage = std::make_shared<ts::DeltaQueueStorage>(db);
-        metadata = std::make_shared<ts::LibraryMetadata>(std::make_shared<ts::LibraryMetadataStorage>(db));
-        clientId = metadata->getClientUuid();
-        subscriptionManager = std::make_shared<ts::SubscriptionManager>(db, transport, subscriptionStorage, metadata);
-        versionIdGenerator = std::make_shared<ts::VersionIdGenerator>(db);
-        callbackManager = std::make_shared<ts::CallbackManager>();
-        collectionStorage = std::make_shared<ts::CollectionStorage>(
-            db, callbackManager, std::make_shared<ts::CollectionIndexStorage>(db),
-            std::make_shared<ts::CollectionObjectStorage>(db), versionIdGenerator);
-        lifecycle = std::make_shared<ts::Lifecycle>();
-        jobQueue = std::make_shared<ts::SerializedJobQueue>(
-            threadCreator, ts::ExponentialBackoff<std::chrono::milliseconds>{std::chrono::milliseconds(1),
-                                                                             std::chrono::milliseconds(20), 2,
-                                                                             std::chrono::milliseconds(1)});
-        deltaQueue = std::make_shared<ts::DeltaQueue>(db, lifecycle, deltaQueueStorage, jobQueue, transport, clientId);
-        deltaHandler = std::make_shared<ts::DeltaHandler>(db, callbackManager, collectionStorage, deltaQueue, lifecycle,
-                                                          transport, jobQueue, subscriptionManager,
-                                                          versionVectorStorage, clientId);
-        snapshotConsumer = std::make_shared<ts::SnapshotConsumer>(deltaQueueStorage, transport, subscriptionManager);
+        if (!database) database = ts::Tessarine::createSqliteDatabase(path, {});
+        using std::chrono::milliseconds;
+        components() = ts::buildStoreComponents(transport, threadCreator, database, deltaQueueStorage,
+                                                {milliseconds(1), milliseconds(20), 2, milliseconds(1)});
         callbackManager->addDeltaReceivedCallback([this](const std::vector<ts::Delta>& deltas) {
             std::lock_guard<std::mutex> lock(receivedMutex);
             for (const auto& d : deltas) received.push_back(d);
@@ -71,22 +55,7 @@ protected:
     }
 
     // Releases the components in the store's destruction order.
-    void tearDownComponents() {
-        snapshotConsumer.reset();
-        lifecycle.reset();
-        deltaQueue.reset();
-        deltaHandler.reset();
-        jobQueue.reset();
-        callbackManager.reset();
-        collectionStorage.reset();
-        versionIdGenerator.reset();
-        subscriptionManager.reset();
-        metadata.reset();
-        versionVectorStorage.reset();
-        subscriptionStorage.reset();
-        deltaQueueStorage.reset();
-        db.reset();
-    }
+    void tearDownComponents() { ts::StoreComponents released(std::move(components())); }
 
     void TearDown() override { tearDownComponents(); }
 
@@ -95,12 +64,11 @@ protected:
         collectionStorage->ensureTableExistsForCollection(collection);
         Delta delta;
         delta.collectionName = collection;
-        delta.versionId = collectionStorage->incrementAndGetVersionId(collection);
         delta.type = ts::SyncProtocol::DeltaType::SAVE;
         delta.primaryKey = key;
         delta.sortKey = "s-" + key;
         delta.blob = std::move(blob);
-        deltaHandler->addLocalDelta(delta);
+        delta.versionId = deltaHandler->addLocalDeltaWithNextVersionId(delta);
         return delta;
     }
 
@@ -138,25 +106,12 @@ protected:
         return received;
     }
 
+    ts::StoreComponents& components() { return *this; }
+
     TempDir dir;
     std::string path = dir.file("store.db");
     std::shared_ptr<FakeTransport> transport = std::make_shared<FakeTransport>();
     std::shared_ptr<CountingThreadCreator> threadCreator = std::make_shared<CountingThreadCreator>();
-    std::shared_ptr<lumivale::sqlite::Database> db;
-    std::shared_ptr<ts::VersionVectorStorage> versionVectorStorage;
-    std::shared_ptr<ts::SubscriptionStorage> subscriptionStorage;
-    std::shared_ptr<ts::DeltaQueueStorage> deltaQueueStorage;
-    std::shared_ptr<ts::LibraryMetadata> metadata;
-    std::string clientId;
-    std::shared_ptr<ts::SubscriptionManager> subscriptionManager;
-    std::shared_ptr<ts::VersionIdGenerator> versionIdGenerator;
-    std::shared_ptr<ts::CallbackManager> callbackManager;
-    std::shared_ptr<ts::CollectionStorage> collectionStorage;
-    std::shared_ptr<ts::Lifecycle> lifecycle;
-    std::shared_ptr<ts::SerializedJobQueue> jobQueue;
-    std::shared_ptr<ts::DeltaQueue> deltaQueue;
-    std::shared_ptr<ts::DeltaHandler> deltaHandler;
-    std::shared_ptr<ts::SnapshotConsumer> snapshotConsumer;
     std::mutex receivedMutex;
     std::vector<ts::Delta> received;
 };

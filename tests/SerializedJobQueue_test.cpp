@@ -11,25 +11,19 @@
 #include <utility>
 #include <vector>
 
+#include "FakeTransport.h"
 #include "TestSupport.h"
 #include "tessarine/SerializedJobQueue.h"
 
 using lumivale::tessarine::ExponentialBackoff;
 using lumivale::tessarine::SerializedJobQueue;
+using testsupport::CountingThreadCreator;
 using testsupport::LogCapture;
 using Job = SerializedJobQueue::Job;
 using Events = std::vector<std::string>;
 using ms = std::chrono::milliseconds;
 
 namespace {
-
-struct CountingThreadCreator : ThreadCreator {
-    std::thread createThread(std::function<void()> body) override {
-        ++calls;
-        return std::thread(std::move(body));
-    }
-    std::atomic<int> calls{0};
-};
 
 ExponentialBackoff<ms> backoff(ms initial, int multiplier, ms max) { return {initial, max, multiplier, initial}; }
 
@@ -134,7 +128,7 @@ TEST(SerializedJobQueueTest, JobsFromSeveralThreadsRunOneAtATimeInPostingOrderOn
     std::vector<int> expected;
     for (int i = 0; i < kJobs; ++i) expected.push_back(i);
     for (const auto& posted : order) EXPECT_EQ(expected, posted);
-    EXPECT_EQ(1, creator->calls);
+    EXPECT_EQ(1, creator->created);
 }
 
 // A job queued behind the running one is not checked here: whether it starts
@@ -230,7 +224,7 @@ TEST(SerializedJobQueueTest, BrokenThreadCreatorOrBackoffFailsConstructionWithou
     EXPECT_THROW(SerializedJobQueue(nullptr, valid), std::runtime_error);
     auto creator = std::make_shared<CountingThreadCreator>();
     EXPECT_THROW(SerializedJobQueue(creator, backoff(ms(5), 0, ms(30000))), std::runtime_error);
-    EXPECT_EQ(0, creator->calls);
+    EXPECT_EQ(0, creator->created);
 }
 
 TEST(ExponentialBackoffTest, PausesDoubleFromFiveMillisecondsUpToTheCapAndResetStartsAgain) {

@@ -78,7 +78,7 @@ TEST_F(SnapshotTest, FailingDeliveryIsLoggedAndThrownToTransport) {
 }
 
 TEST_F(SnapshotTest, GeneratedSnapshotListsObjectsInSortOrderWithNumbers) {
-    ts::SnapshotGenerator generator(db, collectionStorage, subscriptionManager, versionVectorStorage);
+    ts::SnapshotGenerator& generator = *snapshotGenerator;
     auto unsubscribed = generator.generateSnapshot("n:s", "OTHERCLIENT");
     EXPECT_EQ("n:s", unsubscribed.collectionName);
     EXPECT_EQ(0u, unsubscribed.sequenceNumber);

@@ -6,11 +6,9 @@
 #include "TestSupport.h"
 #include "sqlite/Database.h"
 #include "sqlite/SQLiteException.h"
-#include "tessarine/DeltaQueueStorage.h"
-#include "tessarine/SubscriptionStorage.h"
 #include "tessarine/Tessarine.h"
-#include "tessarine/VersionVectorStorage.h"
 
+using lumivale::sqlite::kOpenReadWriteCreate;
 using lumivale::sqlite::Database;
 using lumivale::sqlite::SQLiteException;
 using lumivale::tessarine::Tessarine;
@@ -57,10 +55,7 @@ namespace {
 // walk can be tested on files that are not databases.
 std::unique_ptr<Tessarine> storeOver(std::shared_ptr<Database> db, const std::string& path) {
     return std::make_unique<Tessarine>(std::make_shared<testsupport::FakeTransport>(),
-                                       std::make_shared<testsupport::CountingThreadCreator>(), db,
-                                       std::make_shared<lumivale::tessarine::VersionVectorStorage>(db),
-                                       std::make_shared<lumivale::tessarine::SubscriptionStorage>(db),
-                                       std::make_shared<lumivale::tessarine::DeltaQueueStorage>(db), path);
+                                       std::make_shared<testsupport::CountingThreadCreator>(), db, path);
 }
 
 std::unique_ptr<Tessarine> openStore(const std::string& path) {
@@ -101,10 +96,10 @@ TEST(StoreDatabaseTest, RemoveStopsTheStoreAndDeletesDatabaseAndCompanions) {
 TEST(StoreDatabaseTest, RemoveWithoutCompanionFilesDeletesOnlyTheDatabase) {
     testsupport::TempDir dir;
     const std::string path = dir.file("store.db");
-    Database(path, 6).exec("CREATE TABLE t (x)");  // closed again: no -wal, no -shm
+    Database(path, kOpenReadWriteCreate).exec("CREATE TABLE t (x)");  // closed again: no -wal, no -shm
     ASSERT_TRUE(Tessarine::fileExists(path));
     ASSERT_FALSE(Tessarine::fileExists(path + "-wal"));
-    EXPECT_TRUE(storeOver(std::make_shared<Database>(":memory:", 6), path)->remove());
+    EXPECT_TRUE(storeOver(std::make_shared<Database>(":memory:", kOpenReadWriteCreate), path)->remove());
     EXPECT_FALSE(Tessarine::fileExists(path));
 }
 
@@ -116,7 +111,7 @@ TEST(StoreDatabaseTest, RemoveStopsAtDatabaseThatCannotBeDeleted) {
     touch(path + "/keeps-it-non-empty");
     touch(path + "-shm");
     touch(path + "-wal");
-    EXPECT_FALSE(storeOver(std::make_shared<Database>(":memory:", 6), path)->remove());
+    EXPECT_FALSE(storeOver(std::make_shared<Database>(":memory:", kOpenReadWriteCreate), path)->remove());
     EXPECT_TRUE(Tessarine::fileExists(path + "-shm"));
     EXPECT_TRUE(Tessarine::fileExists(path + "-wal"));
     EXPECT_FALSE(Tessarine::fileExists(dir.file("never-created")));

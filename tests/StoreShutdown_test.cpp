@@ -68,7 +68,7 @@ private:
 // Ends and joins the test's threads also when an assertion leaves early.
 class ThreadsGuard {
 public:
-    explicit ThreadsGuard(std::function<void()> stopAll) : stopAll(std::move(stopAll)) {}
+    explicit ThreadsGuard(std::function<void()> theStopAll) : stopAll(std::move(theStopAll)) {}
     ~ThreadsGuard() {
         stopAll();
         for (std::thread& thread : threads) {

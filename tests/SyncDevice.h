@@ -54,8 +54,8 @@ inline std::vector<std::string> serverRows(const lumivale::tessarine::server::Sy
 }
 
 struct SyncDevice {
-    SyncDevice(std::shared_ptr<lumivale::tessarine::server::SyncServer> server, std::string path, uint64_t seed)
-        : server(std::move(server)), path(std::move(path)) {
+    SyncDevice(std::shared_ptr<lumivale::tessarine::server::SyncServer> theServer, std::string thePath, uint64_t seed)
+        : server(std::move(theServer)), path(std::move(thePath)) {
         open(seed);
     }
 

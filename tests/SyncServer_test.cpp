@@ -39,8 +39,8 @@ Delta deletion(const std::string& clientId, uint64_t versionId, const std::strin
 // One client session; what the server sends it is read back with the
 // store's own readers, so every payload is checked to be what a store reads.
 struct Client {
-    explicit Client(SyncServer& server) : server(server) {
-        id = server.attach([this](std::vector<unsigned char> payload) { payloads.push_back(std::move(payload)); });
+    explicit Client(SyncServer& theServer) : server(theServer) {
+        id = theServer.attach([this](std::vector<unsigned char> payload) { payloads.push_back(std::move(payload)); });
     }
 
     SyncServer::Receipt send(const Delta& delta) {

@@ -8,6 +8,7 @@
 #include "sqlite/Database.h"
 #include "tessarine/VersionIdGenerator.h"
 
+using lumivale::sqlite::kOpenReadWriteCreate;
 using lumivale::sqlite::Database;
 using lumivale::tessarine::VersionIdGenerator;
 
@@ -28,7 +29,7 @@ class VersionIdGeneratorTest : public ::testing::Test {
 protected:
     void reopen() {
         generator.reset();
-        db = std::make_shared<Database>(dir.file("versions.db"), 6);
+        db = std::make_shared<Database>(dir.file("versions.db"), kOpenReadWriteCreate);
         generator = std::make_unique<FailingReadGenerator>(db);
     }
 
@@ -39,7 +40,7 @@ protected:
     }
 
     testsupport::TempDir dir;
-    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("versions.db"), 6);
+    std::shared_ptr<Database> db = std::make_shared<Database>(dir.file("versions.db"), kOpenReadWriteCreate);
     std::unique_ptr<FailingReadGenerator> generator = std::make_unique<FailingReadGenerator>(db);
 };
 

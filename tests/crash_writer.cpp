@@ -51,10 +51,6 @@ public:
     std::atomic<uint64_t> lastVersionId{0};
 };
 
-class PlainThreadCreator : public ThreadCreator {
-    std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
-};
-
 class Journal {
 public:
     explicit Journal(const char* path) : fd(::open(path, O_WRONLY | O_CREAT | O_APPEND, 0644)) {
@@ -81,8 +77,8 @@ private:
 // callback has heard the previous one.
 class RemoteFeed {
 public:
-    RemoteFeed(std::shared_ptr<SyncProtocol> transport, uint64_t firstSequenceNumber)
-        : transport(std::move(transport)), next(firstSequenceNumber) {}
+    RemoteFeed(std::shared_ptr<SyncProtocol> theTransport, uint64_t firstSequenceNumber)
+        : transport(std::move(theTransport)), next(firstSequenceNumber) {}
 
     void onApplied(const std::vector<Delta>& deltas) {
         if (deltas.empty() || deltas.front().collectionName != "crash:remote") return;
@@ -134,7 +130,7 @@ int main(int argc, char** argv) {
     Journal journal(argv[2]);
     std::mt19937 random(static_cast<unsigned>(std::strtoul(argv[3], nullptr, 10)));
     auto transport = std::make_shared<RecordingTransport>();
-    auto store = Tessarine::open(argv[1], transport, std::make_shared<PlainThreadCreator>());
+    auto store = Tessarine::open(argv[1], transport, std::make_shared<StdThreadCreator>());
     if (!store) return 1;
     RemoteFeed feed(transport, std::strtoull(argv[4], nullptr, 10));
     store->addDeltaReceivedCallback([&feed](const std::vector<Delta>& deltas) { feed.onApplied(deltas); });

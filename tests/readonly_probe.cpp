@@ -38,10 +38,6 @@ class SilentTransport : public SyncProtocol {
     void sendSnapshotRequest(const std::string&, const std::string&) override {}
 };
 
-class PlainThreadCreator : public ThreadCreator {
-    std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
-};
-
 bool dropRootRights() {
     if (geteuid() != 0) return true;
     return setgroups(0, nullptr) == 0 && setgid(kUnprivilegedId) == 0 && setuid(kUnprivilegedId) == 0;
@@ -63,7 +59,7 @@ int main(int argc, char** argv) {
     lumivale::setLogSink([report](int priority, const std::string&, const std::string& message) {
         std::fprintf(report, "log %d %s\n", priority, message.c_str());
     });
-    auto store = Tessarine::open(argv[1], std::make_shared<SilentTransport>(), std::make_shared<PlainThreadCreator>());
+    auto store = Tessarine::open(argv[1], std::make_shared<SilentTransport>(), std::make_shared<StdThreadCreator>());
     std::fprintf(report, "open %s\n", store ? "ok" : "failed");
     if (!store) return 0;
     auto items = store->subscribeCollection("app:items");

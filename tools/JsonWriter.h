@@ -23,7 +23,7 @@ namespace inspect {
 
 class JsonWriter {
 public:
-    explicit JsonWriter(std::ostream& out) : out(out) {}
+    explicit JsonWriter(std::ostream& theOut) : out(theOut) {}
 
     void beginObject() { open('{'); }
     void endObject() { close('}'); }

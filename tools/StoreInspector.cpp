@@ -32,7 +32,7 @@ std::vector<unsigned char> readBlob(const Statement& statement, int column) {
 }
 
 uint64_t readCount(const Statement& statement, int column) {
-    return static_cast<uint64_t>(statement(column).getInt64());
+    return statement(column).getUint64();
 }
 
 bool tableExists(Database& database, const std::string& table) {
@@ -55,12 +55,12 @@ std::string describe(const lumivale::sqlite::SQLiteException& e) {
 
 }  // namespace
 
-StoreInspector::StoreInspector(const std::string& path) : path(path) {
+StoreInspector::StoreInspector(const std::string& thePath) : path(thePath) {
     // SQLite would report a missing file only as "unable to open".
     std::error_code error;
-    if (!std::filesystem::is_regular_file(path, error)) throw InspectError("no such file: " + path);
+    if (!std::filesystem::is_regular_file(thePath, error)) throw InspectError("no such file: " + thePath);
     try {
-        database = std::make_shared<Database>(path, SQLITE_OPEN_READONLY);
+        database = std::make_shared<Database>(thePath, SQLITE_OPEN_READONLY);
         database->exec("PRAGMA busy_timeout=" + std::to_string(kBusyTimeout.count()));
     } catch (const lumivale::sqlite::SQLiteException& e) {
         throw InspectError(describe(e));

@@ -27,17 +27,12 @@ public:
     void sendSnapshotRequest(const std::string&, const std::string&) override {}
 };
 
-class PlainThreadCreator : public ThreadCreator {
-public:
-    std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
-};
-
 // True once the store's object has come back from the server PERSISTED.
 bool syncsThroughTheServer(const std::string& path) {
     using namespace lumivale::tessarine;
     auto server = std::make_shared<server::SyncServer>();
     auto store = Tessarine::open(path, std::make_shared<server::LoopbackTransport>(server),
-                                 std::make_shared<PlainThreadCreator>());
+                                 std::make_shared<StdThreadCreator>());
     if (!store) return false;
     store->start();
     auto items = store->subscribeCollection("app:items");
@@ -59,7 +54,7 @@ int main(int argc, char** argv) {
     using lumivale::tessarine::Tessarine;
     if (argc < 2) return 2;
     std::string path = argv[1];
-    auto store = Tessarine::open(path, std::make_shared<OfflineTransport>(), std::make_shared<PlainThreadCreator>());
+    auto store = Tessarine::open(path, std::make_shared<OfflineTransport>(), std::make_shared<StdThreadCreator>());
     if (!store) return 3;
     auto notes = store->subscribeCollection("app:notes");
     if (!notes || !notes->saveObject("pk", "sort", std::vector<unsigned char>{1, 2})) return 4;
