@@ -84,8 +84,8 @@ private:
 
 // A store on any transport whose callback counts what it sees.
 struct Store {
-    Store(const std::string& path, std::shared_ptr<SyncProtocol> transport) : transport(std::move(transport)) {
-        store = ts::Tessarine::open(path, this->transport, std::make_shared<PlainThreadCreator>());
+    Store(const std::string& path, std::shared_ptr<SyncProtocol> theTransport) : transport(std::move(theTransport)) {
+        store = ts::Tessarine::open(path, transport, std::make_shared<StdThreadCreator>());
         store->addDeltaReceivedCallback([this](const std::vector<ts::Delta>& deltas) { callbacks.add(deltas.size()); });
         store->start();
         collection = store->subscribeCollection(kCollection);

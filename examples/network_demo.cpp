@@ -107,21 +107,16 @@ struct Note {
 
 // ---------------------------------------------------------------- device --
 
-class PlainThreadCreator : public ThreadCreator {
-public:
-    std::thread createThread(std::function<void()> body) override { return std::thread(std::move(body)); }
-};
-
 // One device process: a store on its file, synced through the broker.
 class DeviceProcess {
 public:
-    DeviceProcess(std::string name, std::string path, int port, std::string statePath, int64_t startMs)
-        : name(std::move(name)), statePath(std::move(statePath)), startMs(startMs) {
+    DeviceProcess(std::string theName, std::string path, int port, std::string theStatePath, int64_t theStartMs)
+        : name(std::move(theName)), statePath(std::move(theStatePath)), startMs(theStartMs) {
         ts::mqtt::MqttTransport::Options options;
         options.port = port;
         options.maxReconnectDelaySeconds = 2;
         transport = std::make_shared<ts::mqtt::MqttTransport>(options);
-        store = ts::Tessarine::open(path, transport, std::make_shared<PlainThreadCreator>());
+        store = ts::Tessarine::open(path, transport, std::make_shared<StdThreadCreator>());
         if (!store) throw std::runtime_error("cannot open " + path);
         store->addDeltaReceivedCallback([this](const std::vector<ts::Delta>& deltas) { onDeltas(deltas); });
         store->start();
@@ -131,8 +126,8 @@ public:
 
     // Runs commands from standard input until "quit" or its end.
     void run() {
-        int done = 0;
-        writeState(done);
+        int commandsRun = 0;
+        writeState(commandsRun);
         for (std::string line; std::getline(std::cin, line);) {
             std::istringstream words(line);
             std::string command, key;
@@ -155,7 +150,7 @@ public:
             } else if (command == "show") {
                 show();
             }
-            writeState(++done);
+            writeState(++commandsRun);
         }
         notes.reset();
         store.reset();
@@ -319,7 +314,7 @@ struct Setup {
 // A device as the demo drives it: its process and its state file.
 class Device {
 public:
-    Device(std::string name, const Setup& setup) : name(std::move(name)), setup(setup) {}
+    Device(std::string theName, const Setup& theSetup) : name(std::move(theName)), setup(theSetup) {}
 
     void start() {
         commands = 0;

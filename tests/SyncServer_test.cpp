@@ -104,7 +104,7 @@ protected:
 };
 
 INSTANTIATE_TEST_SUITE_P(Storages, SyncServerTest, ::testing::Values(Storage::MEMORY, Storage::SQLITE),
-                         [](const auto& info) { return info.param == Storage::MEMORY ? "Memory" : "Sqlite"; });
+                         [](const auto& paramInfo) { return paramInfo.param == Storage::MEMORY ? "Memory" : "Sqlite"; });
 
 TEST_P(SyncServerTest, ChangeIsAcceptedOncePerClientCollectionAndVersionAndAResendIsEchoedToItsWriterOnly) {
     Client writer(server), reader(server), outsider(server);

@@ -12,7 +12,7 @@ namespace {
 constexpr jint kCallFrame = 8;
 }
 
-JavaTransport::JavaTransport(JNIEnv* env, jobject transport) : transport(env, transport) {}
+JavaTransport::JavaTransport(JNIEnv* env, jobject theTransport) : transport(env, theTransport) {}
 
 void JavaTransport::start() {
     JNIEnv* env = jni::env();

@@ -131,15 +131,15 @@ void throwToJava(JNIEnv* env) noexcept {
     }
 }
 
-GlobalRef::GlobalRef(JNIEnv* env, jobject object) : object(env->NewGlobalRef(object)) {
-    if (this->object == nullptr && object != nullptr) throw std::bad_alloc();
+GlobalRef::GlobalRef(JNIEnv* env, jobject theObject) : object(env->NewGlobalRef(theObject)) {
+    if (object == nullptr && theObject != nullptr) throw std::bad_alloc();
 }
 
 GlobalRef::~GlobalRef() {
     if (object != nullptr) env()->DeleteGlobalRef(object);
 }
 
-LocalFrame::LocalFrame(JNIEnv* env, jint capacity) : env(env) {
+LocalFrame::LocalFrame(JNIEnv* theEnv, jint capacity) : env(theEnv) {
     if (env->PushLocalFrame(capacity) != 0) {
         env->ExceptionClear();
         throw std::bad_alloc();
