@@ -24,7 +24,6 @@
 #include <map>
 #include <memory>
 #include <mutex>
-#include <set>
 #include <sstream>
 #include <string>
 #include <thread>
@@ -32,6 +31,7 @@
 
 #include <sqlite3.h>
 
+#include "examples/DemoNotes.h"
 #include "platform/Log.h"
 #include "sqlite/Database.h"
 #include "tessarine/Collection.h"
@@ -43,6 +43,9 @@
 extern char** environ;
 
 namespace {
+
+using demo::Note;
+using demo::statusName;
 
 namespace ts = lumivale::tessarine;
 
@@ -88,22 +91,6 @@ void say(int64_t startMs, const std::string& who, const std::string& what) {
     std::printf("[%7.3fs] %-7s %s\n", (nowMs() - startMs) / 1000.0, who.c_str(), what.c_str());
     std::fflush(stdout);
 }
-
-std::string statusName(int status) {
-    switch (status) {
-        case 1: return "PENDING";
-        case 2: return "SENT";
-        case 3: return "PERSISTED";
-    }
-    return "status " + std::to_string(status);
-}
-
-struct Note {
-    std::string key;
-    std::string text;
-    int status = 0;
-    bool operator==(const Note& other) const { return key == other.key && text == other.text && status == other.status; }
-};
 
 // ---------------------------------------------------------------- device --
 
@@ -410,29 +397,14 @@ std::vector<Note> serverNotes(const Setup& setup) {
 }
 
 void printTable(const std::vector<Device*>& devices, const Setup& setup) {
-    std::vector<std::vector<Note>> columns;
-    for (const Device* device : devices) columns.push_back(device->notes());
+    std::vector<std::string> names;
+    std::vector<std::vector<demo::Note>> columns;
+    for (const Device* device : devices) {
+        names.push_back(device->name);
+        columns.push_back(device->notes());
+    }
     columns.push_back(serverNotes(setup));
-    std::set<std::string> keys;
-    for (const auto& column : columns) {
-        for (const Note& note : column) keys.insert(note.key);
-    }
-    std::printf("\n%-8s", "note");
-    for (const Device* device : devices) std::printf(" | %-30s", device->name.c_str());
-    std::printf(" | %s\n", "server");
-    for (const std::string& key : keys) {
-        std::printf("%-8s", key.c_str());
-        for (size_t c = 0; c < columns.size(); ++c) {
-            std::string cell = "-";
-            for (const Note& note : columns[c]) {
-                if (note.key != key) continue;
-                cell = "\"" + note.text + "\"";
-                if (c < devices.size()) cell += " " + statusName(note.status);
-            }
-            std::printf(c + 1 < columns.size() ? " | %-30s" : " | %s", cell.c_str());
-        }
-        std::printf("\n");
-    }
+    demo::printNotesTable(names, columns);
 }
 
 void heading(const std::string& title) {

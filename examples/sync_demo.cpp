@@ -10,13 +10,13 @@
 #include <map>
 #include <memory>
 #include <mutex>
-#include <set>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include <unistd.h>
 
+#include "examples/DemoNotes.h"
 #include "platform/Log.h"
 #include "server/LoopbackTransport.h"
 #include "server/SyncServer.h"
@@ -26,6 +26,9 @@
 #include "tessarine/ThreadCreator.h"
 
 namespace {
+
+using demo::Note;
+using demo::statusName;
 
 namespace ts = lumivale::tessarine;
 using ts::server::LoopbackTransport;
@@ -59,15 +62,6 @@ void usage(const char* program) {
         program);
 }
 
-std::string statusName(int status) {
-    switch (status) {
-        case 1: return "PENDING";
-        case 2: return "SENT";
-        case 3: return "PERSISTED";
-    }
-    return "status " + std::to_string(status);
-}
-
 std::string text(const std::vector<unsigned char>& blob) { return std::string(blob.begin(), blob.end()); }
 
 // The timeline: numbered lines with the time since the start and who speaks.
@@ -90,14 +84,6 @@ public:
 private:
     std::mutex mutex;
     const std::chrono::steady_clock::time_point start = std::chrono::steady_clock::now();
-};
-
-struct Note {
-    std::string key;
-    std::string text;
-    int status = 0;
-    bool operator==(const Note& other) const { return key == other.key && text == other.text && status == other.status; }
-    bool operator!=(const Note& other) const { return !(*this == other); }
 };
 
 // One device: a store file, its transport to the server and its handle on
@@ -230,29 +216,14 @@ bool holdsServerNotes(const Device& device, const SyncServer& server) {
 
 // Every note of every device and of the server, side by side.
 void printTable(const std::vector<Device*>& devices, const SyncServer& server) {
-    std::vector<std::vector<Note>> columns;
-    for (const Device* device : devices) columns.push_back(device->objects());
+    std::vector<std::string> names;
+    std::vector<std::vector<demo::Note>> columns;
+    for (const Device* device : devices) {
+        names.push_back(device->name);
+        columns.push_back(device->objects());
+    }
     columns.push_back(serverNotes(server));
-    std::set<std::string> keys;
-    for (const auto& column : columns) {
-        for (const Note& note : column) keys.insert(note.key);
-    }
-    std::printf("\n%-8s", "note");
-    for (const Device* device : devices) std::printf(" | %-30s", device->name.c_str());
-    std::printf(" | %s\n", "server");
-    for (const std::string& key : keys) {
-        std::printf("%-8s", key.c_str());
-        for (size_t c = 0; c < columns.size(); ++c) {
-            std::string cell = "-";
-            for (const Note& note : columns[c]) {
-                if (note.key != key) continue;
-                cell = "\"" + note.text + "\"";
-                if (c < devices.size()) cell += " " + statusName(note.status);
-            }
-            std::printf(c + 1 < columns.size() ? " | %-30s" : " | %s", cell.c_str());
-        }
-        std::printf("\n");
-    }
+    demo::printNotesTable(names, columns);
 }
 
 struct Options {
