@@ -20,6 +20,7 @@
 #include <fstream>
 
 #include "BenchSupport.h"
+#include "server/LoopbackPort.h"
 #include "server/LoopbackTransport.h"
 #include "server/MemoryLogStorage.h"
 #include "server/NetworkSyncServer.h"
@@ -42,43 +43,20 @@ const std::string kWriter = "0123456789ABCDEF0123456789ABCDEF";
 class Broker {
 public:
     explicit Broker(const ScratchDir& dir) {
-        port = freePort();
+        port = ts::server::freeLoopbackPort();
         std::string config = dir.file("mosquitto.conf");
         std::ofstream(config) << "listener " << port << " 127.0.0.1\nallow_anonymous true\n"
                               << "set_tcp_nodelay true\nlog_type error\n" << (geteuid() == 0 ? "user root\n" : "");
         std::string program = "mosquitto", flag = "-c";
         char* argv[] = {program.data(), flag.data(), config.data(), nullptr};
         if (posix_spawnp(&pid, argv[0], nullptr, nullptr, argv, environ) != 0) throw std::runtime_error("no mosquitto");
-        for (int attempt = 0; attempt < 2000 && !accepts(); ++attempt) usleep(5000);
+        for (int attempt = 0; attempt < 2000 && !ts::server::acceptsLoopbackConnections(port); ++attempt) usleep(5000);
     }
     ~Broker() {
         kill(pid, SIGTERM);
         waitpid(pid, nullptr, 0);
     }
     int port = 0;
-
-private:
-    static int freePort() {
-        int fd = socket(AF_INET, SOCK_STREAM, 0);
-        sockaddr_in address{};
-        address.sin_family = AF_INET;
-        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        socklen_t length = sizeof address;
-        bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address);
-        getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length);
-        close(fd);
-        return ntohs(address.sin_port);
-    }
-    bool accepts() const {
-        int fd = socket(AF_INET, SOCK_STREAM, 0);
-        sockaddr_in address{};
-        address.sin_family = AF_INET;
-        address.sin_port = htons(static_cast<uint16_t>(port));
-        address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-        bool accepted = connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
-        close(fd);
-        return accepted;
-    }
     pid_t pid = -1;
 };
 

@@ -33,6 +33,7 @@
 
 #include "examples/DemoNotes.h"
 #include "platform/Log.h"
+#include "server/LoopbackPort.h"
 #include "sqlite/Database.h"
 #include "tessarine/Collection.h"
 #include "tessarine/Cursor.h"
@@ -257,29 +258,6 @@ private:
     int input = -1;
 };
 
-int freePort() {
-    int fd = socket(AF_INET, SOCK_STREAM, 0);
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t length = sizeof address;
-    bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address);
-    getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length);
-    close(fd);
-    return ntohs(address.sin_port);
-}
-
-bool acceptsConnections(int port) {
-    int fd = socket(AF_INET, SOCK_STREAM, 0);
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_port = htons(static_cast<uint16_t>(port));
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    bool accepted = connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
-    close(fd);
-    return accepted;
-}
-
 // ------------------------------------------------------------------ demo --
 
 struct Setup {
@@ -495,7 +473,7 @@ bool story(const Setup& setup) {
 
 // Starts the broker and the server, runs the story, stops them.
 bool runDemo(Setup& setup) {
-    setup.port = freePort();
+    setup.port = ts::server::freeLoopbackPort();
     std::string config = setup.folder + "/mosquitto.conf";
     {
         std::ofstream out(config);
@@ -506,7 +484,7 @@ bool runDemo(Setup& setup) {
     }
     Child broker({"mosquitto", "-c", config}, false);
     auto deadline = std::chrono::steady_clock::now() + kStepDeadline;
-    while (!acceptsConnections(setup.port)) {
+    while (!ts::server::acceptsLoopbackConnections(setup.port)) {
         if (std::chrono::steady_clock::now() > deadline) {
             std::fprintf(stderr, "the broker did not start (is mosquitto installed? scripts/setup.sh)\n");
             return false;

@@ -15,37 +15,13 @@
 #include <string>
 
 #include "ChildProcess.h"
+#include "server/LoopbackPort.h"
 #include "TestSupport.h"
 
 namespace testsupport {
 
-// True when something accepts TCP connections on 127.0.0.1:port.
-inline bool acceptsConnections(int port) {
-    int fd = ::socket(AF_INET, SOCK_STREAM, 0);
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_port = htons(static_cast<uint16_t>(port));
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    bool accepted = ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
-    ::close(fd);
-    return accepted;
-}
-
-// A port of 127.0.0.1 that was free a moment ago (the kernel's choice).
-inline int freePort() {
-    int fd = ::socket(AF_INET, SOCK_STREAM, 0);
-    sockaddr_in address{};
-    address.sin_family = AF_INET;
-    address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t length = sizeof address;
-    if (::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
-        ::getsockname(fd, reinterpret_cast<sockaddr*>(&address), &length) != 0) {
-        ::close(fd);
-        throw std::runtime_error("no free port");
-    }
-    ::close(fd);
-    return ntohs(address.sin_port);
-}
+using lumivale::tessarine::server::acceptsLoopbackConnections;
+using lumivale::tessarine::server::freeLoopbackPort;
 
 struct MqttBrokerOptions {
     // Not empty: only this user, with this password, may connect.
@@ -58,7 +34,7 @@ struct MqttBrokerOptions {
 class MqttBroker {
 public:
     explicit MqttBroker(const TempDir& dir, const MqttBrokerOptions& options = {})
-        : port(freePort()), caFile(dir.file(std::to_string(port) + "-ca.crt")),
+        : port(freeLoopbackPort()), caFile(dir.file(std::to_string(port) + "-ca.crt")),
           config(dir.file(std::to_string(port) + "-mosquitto.conf")) {
         std::ofstream out(config);
         out << "listener " << port << " 127.0.0.1\nset_tcp_nodelay true\nlog_type error\nlog_type warning\n";
@@ -90,7 +66,7 @@ public:
     // Starts the broker and waits until it accepts connections.
     void start() {
         process = std::make_unique<ChildProcess>("mosquitto", std::vector<std::string>{"-c", config});
-        if (!waitUntil([&] { return acceptsConnections(port); })) throw std::runtime_error("mosquitto did not start");
+        if (!waitUntil([&] { return acceptsLoopbackConnections(port); })) throw std::runtime_error("mosquitto did not start");
     }
 
     // Kills it without warning, as a crash would.
