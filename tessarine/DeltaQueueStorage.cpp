@@ -9,8 +9,9 @@ namespace tessarine {
 
 namespace {
 
-const char* const kSelectColumns =
-    "SELECT  collection_name,  version_id,  type,  primary_key,  sort_key,  blob,  status FROM ";
+// The delta's columns (read by readDeltaInto as 0 to 5), then one more.
+const char* const kSelectDelta = "SELECT  collection_name,  version_id,  type,  primary_key,  sort_key,  blob,  ";
+const std::string kSelectColumns = std::string(kSelectDelta) + "status FROM ";
 const char* const kWhereDelta = " WHERE  collection_name = ? AND   version_id = ?";
 
 // Reads the delta of the statement's current row (columns 0 to 5) into
@@ -124,9 +125,8 @@ std::optional<SyncProtocol::DeltaStatus> DeltaQueueStorage::getDeltaStatus(const
 void DeltaQueueStorage::readDeltasInIdRange(int64_t afterId, int64_t upToId, int limit,
                                             std::vector<QueuedDelta>& rows) {
     lumivale::sqlite::Database::ScopedLock lock(*database);
-    auto statement = database->prepare(std::string("SELECT  collection_name,  version_id,  type,  primary_key,  "
-                                                   "sort_key,  blob,  id FROM ") +
-                                       getTableName() + " WHERE id > ? AND id <= ? ORDER BY id ASC LIMIT ?");
+    auto statement = database->prepare(
+        dbqueries::concat({kSelectDelta, "id FROM ", getTableName(), " WHERE id > ? AND id <= ? ORDER BY id ASC LIMIT ?"}));
     statement.bind(1, static_cast<long long>(afterId));
     statement.bind(2, static_cast<long long>(upToId));
     statement.bind(3, limit);
