@@ -1,0 +1,198 @@
+#include "server/CollectionLeases.h"
+
+#include <algorithm>
+
+#include "platform/Log.h"
+
+namespace lumivale {
+namespace tessarine {
+namespace server {
+
+namespace {
+
+constexpr const char* kTag = "tessarine_server";
+constexpr int kWarningPriority = 5;
+constexpr int kInfoPriority = 4;
+
+// A PostgreSQL text[] literal: {"a","b"}, quotes and backslashes escaped.
+std::string arrayLiteral(const std::vector<std::string>& values) {
+    std::string literal = "{";
+    for (const std::string& value : values) {
+        if (literal.size() > 1) literal += ",";
+        literal += "\"";
+        for (char c : value) {
+            if (c == '"' || c == '\\') literal += '\\';
+            literal += c;
+        }
+        literal += "\"";
+    }
+    return literal + "}";
+}
+
+std::set<std::string> collectionsOf(const PgResult& result) {
+    std::set<std::string> collections;
+    for (int row = 0; row < result.rows(); ++row) collections.insert(result.text(row, 0));
+    return collections;
+}
+
+}  // namespace
+
+CollectionLeases::CollectionLeases(const std::string& conninfo, std::string id, Timings theTimings,
+                                   Handlers theHandlers)
+    : connection(conninfo), instanceId(std::move(id)), timings(theTimings), handlers(std::move(theHandlers)) {}
+
+CollectionLeases::~CollectionLeases() { stop(); }
+
+void CollectionLeases::start() {
+    std::lock_guard<std::mutex> lock(mutex);
+    stopping = false;
+    if (!keeper.joinable()) keeper = std::thread([this] { run(); });
+}
+
+void CollectionLeases::stop() {
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        stopping = true;
+    }
+    wake.notify_all();
+    if (!keeper.joinable()) return;
+    keeper.join();
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        held.clear();
+    }
+    release();
+}
+
+uint64_t CollectionLeases::epoch(const std::string& collection) const {
+    std::lock_guard<std::mutex> lock(mutex);
+    auto found = held.find(collection);
+    if (found == held.end() || std::chrono::steady_clock::now() >= found->second.validUntil) return 0;
+    return found->second.epoch;
+}
+
+void CollectionLeases::noticed(const std::string& collection) {
+    bool isNew = false;
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        if (held.count(collection) == 0) isNew = deferredRounds.emplace(collection, 0).second;
+    }
+    if (isNew) wake.notify_all();
+}
+
+void CollectionLeases::run() {
+    std::unique_lock<std::mutex> lock(mutex);
+    while (!stopping) {
+        auto roundStart = std::chrono::steady_clock::now();
+        lock.unlock();
+        round();
+        lock.lock();
+        // A newly noticed collection (deferral count 0) starts a round early.
+        wake.wait_until(lock, roundStart + timings.renewPeriod, [&] {
+            return stopping || std::any_of(deferredRounds.begin(), deferredRounds.end(),
+                                           [](const auto& entry) { return entry.second == 0; });
+        });
+    }
+}
+
+void CollectionLeases::round() {
+    auto roundStart = std::chrono::steady_clock::now();
+    if (handlers.mayRenew && !handlers.mayRenew()) {
+        // Not renewed: the leases lapse by themselves. Nothing is tried
+        // either, so the noticed collections are not retried at once.
+        std::lock_guard<std::mutex> lock(mutex);
+        for (auto& entry : deferredRounds) entry.second = std::max(entry.second, 1);
+        return;
+    }
+    bool acquired = false;
+    try {
+        std::set<std::string> nowHeld = renew();
+        std::set<std::string> taken = take(candidates());
+        nowHeld.insert(taken.begin(), taken.end());
+        acquired = settle(nowHeld, roundStart);
+    } catch (const PgError& e) {
+        if (!failing) {
+            lv_printLog(kWarningPriority, kTag,
+                        "CollectionLeases: %s cannot renew its leases (%s); they lapse until the database is back",
+                        instanceId.c_str(), e.what());
+        }
+        failing = true;
+        std::lock_guard<std::mutex> lock(mutex);
+        for (auto& entry : deferredRounds) entry.second = std::max(entry.second, 1);
+        return;
+    }
+    if (failing) lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s renews its leases again", instanceId.c_str());
+    failing = false;
+    if (handlers.afterRound) handlers.afterRound(acquired);
+}
+
+std::set<std::string> CollectionLeases::renew() {
+    return collectionsOf(connection.exec(
+        "UPDATE tessarine_leases SET expires_at = now() + $2::bigint * interval '1 millisecond'"
+        " WHERE holder = $1 AND expires_at > now() RETURNING collection",
+        {instanceId, static_cast<int64_t>(timings.duration.count())}));
+}
+
+std::set<std::string> CollectionLeases::take(const std::vector<std::string>& collections) {
+    if (collections.empty()) return {};
+    // Sorted, so that instances taking several leases lock rows in one order.
+    return collectionsOf(connection.exec(
+        "INSERT INTO tessarine_leases (collection, holder, expires_at)"
+        " SELECT name, $2, now() + $3::bigint * interval '1 millisecond'"
+        " FROM unnest($1::text[]) AS name ORDER BY name"
+        " ON CONFLICT (collection) DO UPDATE SET holder = EXCLUDED.holder, expires_at = EXCLUDED.expires_at"
+        " WHERE tessarine_leases.expires_at <= now() OR tessarine_leases.holder = EXCLUDED.holder"
+        " RETURNING collection",
+        {arrayLiteral(collections), instanceId, static_cast<int64_t>(timings.duration.count())}));
+}
+
+std::vector<std::string> CollectionLeases::candidates() {
+    std::lock_guard<std::mutex> lock(mutex);
+    int deferral = std::min(static_cast<int>(held.size()), kMaxDeferredRounds);
+    std::vector<std::string> names;
+    for (auto& [name, rounds] : deferredRounds) {
+        if (rounds >= deferral) names.push_back(name);
+        ++rounds;
+    }
+    return names;
+}
+
+bool CollectionLeases::settle(const std::set<std::string>& nowHeld, std::chrono::steady_clock::time_point roundStart) {
+    std::lock_guard<std::mutex> lock(mutex);
+    auto validUntil = roundStart + timings.duration - timings.renewPeriod;
+    bool acquired = false;
+    // A lease that lapsed here is a new one even if this instance got it
+    // back: the collection may have been served elsewhere meanwhile.
+    for (auto entry = held.begin(); entry != held.end();) {
+        bool keep = nowHeld.count(entry->first) != 0 && roundStart < entry->second.validUntil;
+        if (!keep) {
+            lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s no longer serves \"%s\"", instanceId.c_str(),
+                        entry->first.c_str());
+            deferredRounds.emplace(entry->first, kMaxDeferredRounds);
+        }
+        entry = keep ? std::next(entry) : held.erase(entry);
+    }
+    for (const std::string& name : nowHeld) {
+        auto [entry, isNew] = held.emplace(name, Held{0, validUntil});
+        entry->second.validUntil = validUntil;
+        if (!isNew) continue;
+        entry->second.epoch = ++lastEpoch;
+        deferredRounds.erase(name);
+        acquired = true;
+        lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s serves \"%s\"", instanceId.c_str(), name.c_str());
+    }
+    return acquired;
+}
+
+void CollectionLeases::release() {
+    try {
+        connection.exec("UPDATE tessarine_leases SET expires_at = now() WHERE holder = $1", {instanceId});
+    } catch (const PgError& e) {
+        lv_printLog(kWarningPriority, kTag, "CollectionLeases: %s could not end its leases (%s); they lapse",
+                    instanceId.c_str(), e.what());
+    }
+}
+
+}  // namespace server
+}  // namespace tessarine
+}  // namespace lumivale
