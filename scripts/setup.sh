@@ -23,6 +23,7 @@ packages=(
   libbenchmark-dev
   libmosquitto-dev mosquitto mosquitto-clients
   openssl
+  postgresql-15 libpq-dev
 )
 # The Java API and its checks (plain, asan and clang configurations): the JDK,
 # JUnit and npm for the Kotlin compiler; Debian's host liblog for the Android

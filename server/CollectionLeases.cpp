@@ -75,7 +75,7 @@ void CollectionLeases::noticed(const std::string& collection) {
     bool isNew = false;
     {
         std::lock_guard<std::mutex> lock(mutex);
-        if (held.count(collection) == 0) isNew = deferredRounds.emplace(collection, 0).second;
+        if (held.count(collection) == 0) isNew = waitingRounds.emplace(collection, 0).second;
     }
     if (isNew) wake.notify_all();
 }
@@ -87,9 +87,9 @@ void CollectionLeases::run() {
         lock.unlock();
         round();
         lock.lock();
-        // A newly noticed collection (deferral count 0) starts a round early.
+        // A newly noticed collection (no round waited) starts a round early.
         wake.wait_until(lock, roundStart + timings.renewPeriod, [&] {
-            return stopping || std::any_of(deferredRounds.begin(), deferredRounds.end(),
+            return stopping || std::any_of(waitingRounds.begin(), waitingRounds.end(),
                                            [](const auto& entry) { return entry.second == 0; });
         });
     }
@@ -101,15 +101,17 @@ void CollectionLeases::round() {
         // Not renewed: the leases lapse by themselves. Nothing is tried
         // either, so the noticed collections are not retried at once.
         std::lock_guard<std::mutex> lock(mutex);
-        for (auto& entry : deferredRounds) entry.second = std::max(entry.second, 1);
+        for (auto& entry : waitingRounds) entry.second = std::max(entry.second, 1);
         return;
     }
     bool acquired = false;
     try {
-        std::set<std::string> nowHeld = renew();
-        std::set<std::string> taken = take(candidates());
+        std::set<std::string> nowHeld;
+        int64_t liveInstances = renew(nowHeld);
+        std::set<std::string> taken = take(candidates(liveInstances));
         nowHeld.insert(taken.begin(), taken.end());
         acquired = settle(nowHeld, roundStart);
+        if (std::optional<std::string> surplus = surplusOf(liveInstances)) handOver(*surplus);
     } catch (const PgError& e) {
         if (!failing) {
             lv_printLog(kWarningPriority, kTag,
@@ -118,7 +120,7 @@ void CollectionLeases::round() {
         }
         failing = true;
         std::lock_guard<std::mutex> lock(mutex);
-        for (auto& entry : deferredRounds) entry.second = std::max(entry.second, 1);
+        for (auto& entry : waitingRounds) entry.second = std::max(entry.second, 1);
         return;
     }
     if (failing) lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s renews its leases again", instanceId.c_str());
@@ -126,11 +128,24 @@ void CollectionLeases::round() {
     if (handlers.afterRound) handlers.afterRound(acquired);
 }
 
-std::set<std::string> CollectionLeases::renew() {
-    return collectionsOf(connection.exec(
+int64_t CollectionLeases::renew(std::set<std::string>& renewed) {
+    const int64_t durationMs = timings.duration.count();
+    PgTransaction transaction(connection);
+    // A renewal lost in a database crash only makes the lease look older,
+    // which is safe (the log's writes check the lease themselves): renewals
+    // need not wait for the disk, which may be slow under load.
+    connection.exec("SET LOCAL synchronous_commit = off");
+    renewed = collectionsOf(connection.exec(
         "UPDATE tessarine_leases SET expires_at = now() + $2::bigint * interval '1 millisecond'"
         " WHERE holder = $1 AND expires_at > now() RETURNING collection",
-        {instanceId, static_cast<int64_t>(timings.duration.count())}));
+        {instanceId, durationMs}));
+    connection.exec(
+        "INSERT INTO tessarine_instances (instance, expires_at) VALUES ($1, now() + $2::bigint * interval '1 millisecond')"
+        " ON CONFLICT (instance) DO UPDATE SET expires_at = EXCLUDED.expires_at",
+        {instanceId, durationMs});
+    int64_t live = connection.exec("SELECT COUNT(*) FROM tessarine_instances WHERE expires_at > now()").integer(0, 0);
+    transaction.commit();
+    return live;
 }
 
 std::set<std::string> CollectionLeases::take(const std::vector<std::string>& collections) {
@@ -146,15 +161,45 @@ std::set<std::string> CollectionLeases::take(const std::vector<std::string>& col
         {arrayLiteral(collections), instanceId, static_cast<int64_t>(timings.duration.count())}));
 }
 
-std::vector<std::string> CollectionLeases::candidates() {
+std::vector<std::string> CollectionLeases::candidates(int64_t liveInstances) {
     std::lock_guard<std::mutex> lock(mutex);
-    int deferral = std::min(static_cast<int>(held.size()), kMaxDeferredRounds);
-    std::vector<std::string> names;
-    for (auto& [name, rounds] : deferredRounds) {
-        if (rounds >= deferral) names.push_back(name);
+    int64_t room = shareOf(liveInstances) - static_cast<int64_t>(held.size());
+    std::vector<std::string> free;
+    std::vector<std::string> overdue;
+    for (auto& [name, rounds] : waitingRounds) {
+        (rounds >= kMaxWaitRounds ? overdue : free).push_back(name);
         ++rounds;
     }
-    return names;
+    std::shuffle(free.begin(), free.end(), random);
+    if (room > 0 && static_cast<size_t>(room) < free.size()) free.resize(static_cast<size_t>(room));
+    if (room <= 0) free.clear();
+    free.insert(free.end(), overdue.begin(), overdue.end());
+    return free;
+}
+
+// The share of an instance: the collections it knows of over the live
+// instances, rounded up.
+int64_t CollectionLeases::shareOf(int64_t liveInstances) const {
+    int64_t known = static_cast<int64_t>(held.size() + waitingRounds.size());
+    return (known + liveInstances - 1) / std::max<int64_t>(liveInstances, 1);
+}
+
+std::optional<std::string> CollectionLeases::surplusOf(int64_t liveInstances) {
+    std::lock_guard<std::mutex> lock(mutex);
+    if (static_cast<int64_t>(held.size()) <= shareOf(liveInstances)) return std::nullopt;
+    auto chosen = std::next(held.begin(), std::uniform_int_distribution<size_t>(0, held.size() - 1)(random));
+    std::string name = chosen->first;
+    held.erase(chosen);
+    // Not retried before the others had a round to take it.
+    waitingRounds[name] = 1;
+    return name;
+}
+
+void CollectionLeases::handOver(const std::string& collection) {
+    lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s hands \"%s\" over: it serves more than its share",
+                instanceId.c_str(), collection.c_str());
+    connection.exec("UPDATE tessarine_leases SET expires_at = now() WHERE collection = $1 AND holder = $2",
+                    {collection, instanceId});
 }
 
 bool CollectionLeases::settle(const std::set<std::string>& nowHeld, std::chrono::steady_clock::time_point roundStart) {
@@ -168,7 +213,7 @@ bool CollectionLeases::settle(const std::set<std::string>& nowHeld, std::chrono:
         if (!keep) {
             lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s no longer serves \"%s\"", instanceId.c_str(),
                         entry->first.c_str());
-            deferredRounds.emplace(entry->first, kMaxDeferredRounds);
+            waitingRounds.emplace(entry->first, kMaxWaitRounds);
         }
         entry = keep ? std::next(entry) : held.erase(entry);
     }
@@ -177,7 +222,7 @@ bool CollectionLeases::settle(const std::set<std::string>& nowHeld, std::chrono:
         entry->second.validUntil = validUntil;
         if (!isNew) continue;
         entry->second.epoch = ++lastEpoch;
-        deferredRounds.erase(name);
+        waitingRounds.erase(name);
         acquired = true;
         lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s serves \"%s\"", instanceId.c_str(), name.c_str());
     }
@@ -187,6 +232,7 @@ bool CollectionLeases::settle(const std::set<std::string>& nowHeld, std::chrono:
 void CollectionLeases::release() {
     try {
         connection.exec("UPDATE tessarine_leases SET expires_at = now() WHERE holder = $1", {instanceId});
+        connection.exec("DELETE FROM tessarine_instances WHERE instance = $1", {instanceId});
     } catch (const PgError& e) {
         lv_printLog(kWarningPriority, kTag, "CollectionLeases: %s could not end its leases (%s); they lapse",
                     instanceId.c_str(), e.what());

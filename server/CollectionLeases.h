@@ -6,13 +6,18 @@
 //
 // A lease is taken when it is free: never taken, expired (its holder died,
 // or lost its broker or the database), or already this instance's. An
-// instance learns of collections from the requests it sees (noticed); one
-// it does not serve is tried at the next round, and at once when new. So
-// that collections spread over the instances, an instance that already
-// serves n collections lets a newly noticed one go to others for
-// min(n, kMaxDeferredRounds) rounds first. Leases are renewed only while
-// mayRenew() (the instance is connected to its broker): an instance cut off
-// from its clients lets its collections go within a lease's duration.
+// instance learns of collections from the requests it sees (noticed); those
+// it does not serve are tried at the next round, at once when new. So that
+// collections spread over the instances, each instance also renews a row of
+// "tessarine_instances" and takes, per round, no more than its fair share:
+// the collections it knows of divided by the live instances, rounded up,
+// picked at random among the free ones; one that serves more than its share
+// (it started first, say) hands one collection over per round, ending its
+// lease for another instance to take. A collection left unserved for
+// kMaxWaitRounds rounds is taken by whoever sees it, share or not. Leases
+// are renewed only while mayRenew() (the instance is connected to its
+// broker): an instance cut off from its clients lets its collections go
+// within a lease's duration.
 //
 // Locally a lease counts as held until renewPeriod before it expires (its
 // expiry is measured from before the renewal was sent, so the local clock
@@ -41,6 +46,8 @@
 #include <functional>
 #include <map>
 #include <mutex>
+#include <optional>
+#include <random>
 #include <set>
 #include <string>
 #include <thread>
@@ -55,7 +62,7 @@ namespace server {
 
 class CollectionLeases : public CollectionOwnership {
 public:
-    static constexpr int kMaxDeferredRounds = 3;
+    static constexpr int kMaxWaitRounds = 3;
 
     struct Timings {
         std::chrono::milliseconds renewPeriod{1000};
@@ -87,10 +94,16 @@ private:
 
     void run();
     void round();
-    std::set<std::string> renew();
+    // Renews this instance's leases and its own row; returns the live
+    // instances, itself included.
+    int64_t renew(std::set<std::string>& renewed);
     std::set<std::string> take(const std::vector<std::string>& candidates);
-    // Collections to try this round; counts a deferral for the others.
-    std::vector<std::string> candidates();
+    // Collections to try this round; counts a round waited for all.
+    std::vector<std::string> candidates(int64_t liveInstances);
+    int64_t shareOf(int64_t liveInstances) const;  // under the lock
+    // A collection to hand over, already given up here; empty when none.
+    std::optional<std::string> surplusOf(int64_t liveInstances);
+    void handOver(const std::string& collection);
     // Records what the database said; true when something was acquired.
     bool settle(const std::set<std::string>& nowHeld, std::chrono::steady_clock::time_point roundStart);
     void release();
@@ -103,10 +116,11 @@ private:
     mutable std::mutex mutex;  // guards the members below
     std::condition_variable wake;
     std::map<std::string, Held> held;
-    std::map<std::string, int> deferredRounds;  // noticed collections not held, and rounds waited
+    std::map<std::string, int> waitingRounds;  // noticed collections not held, and rounds waited
     uint64_t lastEpoch = 0;
     bool stopping = false;
     bool failing = false;  // the last round failed (logged once)
+    std::mt19937 random{std::random_device{}()};  // the keeper thread's
     std::thread keeper;
 };
 

@@ -21,6 +21,7 @@ constexpr const char* kTables[] = {
     "CREATE TABLE IF NOT EXISTS tessarine_sequences (collection TEXT PRIMARY KEY, last BIGINT NOT NULL)",
     "CREATE TABLE IF NOT EXISTS tessarine_leases ("
     " collection TEXT PRIMARY KEY, holder TEXT NOT NULL, expires_at TIMESTAMPTZ NOT NULL)",
+    "CREATE TABLE IF NOT EXISTS tessarine_instances (instance TEXT PRIMARY KEY, expires_at TIMESTAMPTZ NOT NULL)",
 };
 
 }  // namespace

@@ -11,6 +11,8 @@
 //                          its row is the lock that orders a collection's
 //                          writers
 //   "tessarine_leases"     which instance serves which collection, until when
+//   "tessarine_instances"  the live instances, until when (to share the
+//                          collections out evenly)
 //
 // Errors: PgError.
 #pragma once

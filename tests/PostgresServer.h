@@ -51,7 +51,7 @@ public:
     // Starts the server and waits until it accepts connections.
     void start() {
         process = spawn(asPostgres("postgres", {"-D", data, "-k", dir.path().string(), "-p", std::to_string(port), "-c",
-                                                "listen_addresses=127.0.0.1", "-c", "log_min_messages=warning", "-c",
+                                                "listen_addresses=127.0.0.1", "-c", "log_min_messages=fatal", "-c",
                                                 durable ? "fsync=on" : "fsync=off"}));
         bool ready = waitUntil([&] {
             ChildProcess probe(std::string(kBinaries) + "pg_isready",

@@ -70,8 +70,8 @@ protected:
     // is away.
     std::vector<std::string> query(const std::string& sql) {
         try {
-            ts::server::PgConnection connection(postgres.conninfo());
-            ts::server::PgResult result = connection.exec(sql);
+            if (!reader) reader = std::make_unique<ts::server::PgConnection>(postgres.conninfo());
+            ts::server::PgResult result = reader->exec(sql);
             std::vector<std::string> rows;
             for (int row = 0; row < result.rows(); ++row) {
                 std::string text;
@@ -154,6 +154,7 @@ protected:
     TempDir dir;
     testsupport::PostgresServer postgres;
     testsupport::MqttBroker broker{dir};
+    std::unique_ptr<ts::server::PgConnection> reader;  // reconnects by itself after a restart
     std::map<std::string, std::unique_ptr<ChildProcess>> instances;
     std::vector<std::unique_ptr<ChildProcess>> devices;
     std::vector<std::string> tags;
