@@ -17,7 +17,8 @@ namespace {
 namespace mqtt = lumivale::tessarine::mqtt;
 using lumivale::tessarine::server::freeLoopbackPort;
 
-const char* const kProbeTopic = "/nats_cluster_probe";
+// Two levels: not one of the server's request topics ("/+").
+const char* const kProbeTopic = "/tessarine_test/nats_cluster_probe";
 constexpr size_t kLogTailBytes = 4000;
 
 // One MQTT client per running node, each publishing its node's number on
@@ -124,7 +125,7 @@ NatsCluster::NatsCluster(const TempDir& dir) {
             separator = ", ";
         }
         out << " ]\n}\n"
-            << "mqtt {\n  listen: 127.0.0.1:" << nodes[i].mqttPort << "\n}\n";
+            << "mqtt {\n  listen: 127.0.0.1:" << nodes[i].mqttPort << "\n  stream_replicas: " << kNodes << "\n}\n";
     }
 }
 
