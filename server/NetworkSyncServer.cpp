@@ -17,6 +17,12 @@ namespace server {
 
 namespace {
 constexpr const char* kTag = "tessarine_server";
+// The three request topics (and the server's own token) are the levels
+// under the root. One subscription takes them all, so that the broker hands
+// them over in the order each client published them: a client's changes
+// must come after its subscription, and a broker keeps order only within a
+// subscription (NATS, for one, keeps each subscription's queue apart).
+constexpr const char* kRequestTopics = "/+";
 }  // namespace
 
 NetworkSyncServer::NetworkSyncServer(const Options& options)
@@ -29,10 +35,7 @@ NetworkSyncServer::NetworkSyncServer(const Options& options)
                          handleMessage(topic, payload);
                      },
                      nullptr, nullptr}) {
-    for (const char* topic : {protocol::TOPIC_CHANGE_RECORD, protocol::TOPIC_SUBSCRIBE_COLLECTION,
-                              protocol::TOPIC_SNAPSHOT}) {
-        connection.subscribe(topic);
-    }
+    connection.subscribe(kRequestTopics);
 }
 
 NetworkSyncServer::~NetworkSyncServer() = default;
@@ -51,6 +54,7 @@ void NetworkSyncServer::handleConnected() {
 }
 
 void NetworkSyncServer::handleMessage(const std::string& topic, const std::vector<unsigned char>& payload) {
+    if (topic == mqtt::TOPIC_SERVER_ONLINE) return;  // its own token
     bool transient = false;
     SyncServer::SessionId session = sessionFor(topic, payload, transient);
     if (session == 0) {
