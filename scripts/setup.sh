@@ -22,6 +22,8 @@ packages=(
   libgtest-dev libgmock-dev
   libbenchmark-dev
   libmosquitto-dev mosquitto mosquitto-clients
+  # The networked sync tests' clustered broker: three nodes with MQTT listeners.
+  nats-server
   openssl
 )
 # The Java API and its checks (plain, asan and clang configurations): the JDK,
