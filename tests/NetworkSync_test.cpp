@@ -245,7 +245,7 @@ TEST_F(ClusteredBrokerTest, NodeOfServerAndStoreKilledMidStreamLosesNoPersistedC
     cluster.start();
     auto server = startServer(cluster.port(0));
     startDevices(40, 25);
-    ASSERT_TRUE(waitUntil([&] { return changesLogged() >= 10; }));
+    ASSERT_TRUE(waitUntil([&] { return changesLogged() >= 10; })) << cluster.logTail(0);
     cluster.kill(0);
     cluster.start(0);
     ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();

@@ -17,10 +17,11 @@ constexpr const char* kTag = "tessarine";
 constexpr int kQos = 1;
 // What a SUBACK grants for a subscription the broker refused.
 constexpr int kRefused = 0x80;
-// A refused subscription is asked for again at once, up to this many times
-// per connection: a broker that is still electing its leaders (a NATS node
-// that just joined) refuses for a while, one that forbids the topic forever.
-constexpr int kMaxSubscribeAttempts = 20;
+// A refused subscription is asked for again as soon as the refusal comes,
+// up to this many times per connection: a broker that is still electing its
+// leaders (a NATS node that just joined) refuses for seconds, each refusal
+// taking it tens of milliseconds; one that forbids the topic does so forever.
+constexpr int kMaxSubscribeAttempts = 200;
 
 void initialiseLibrary() {
     static const int once = mosquitto_lib_init();
@@ -201,8 +202,10 @@ void MqttConnection::handleSubscribed(struct mosquitto* mosq, int messageId, int
         announce = announce || (awaited.empty() && !announced);
     }
     if (attempts > 0 && attempts < kMaxSubscribeAttempts) {
-        lv_printLog(5, kTag, "%s: the broker refused the subscription to \"%s\"; asking again", name.c_str(),
-                    topic.c_str());
+        if (attempts == 1) {
+            lv_printLog(5, kTag, "%s: the broker refused the subscription to \"%s\"; asking again", name.c_str(),
+                        topic.c_str());
+        }
         requestSubscription(mosq, topic);
         return;
     }

@@ -16,9 +16,10 @@
 //   - disconnected: the connection went down (or an attempt failed).
 // An exception a handler throws is logged and goes no further. A
 // subscription the broker refuses (a NATS node whose JetStream is not ready
-// yet) is asked for again, up to a limit per connection, each refusal logged. A refused
-// connection (bad credentials, say) is logged under the connection's name
-// ("<name>: connection refused: <reason>") and tried again after the back-off.
+// yet) is asked for again, up to a limit per connection (the first refusal
+// and giving up are logged). A refused connection (bad credentials, say) is
+// logged under the connection's name ("<name>: connection refused:
+// <reason>") and tried again after the back-off.
 //
 // Threads: every operation may be called from any thread, handlers
 // included, except that start() and stop() must not run at the same time.
