@@ -22,6 +22,8 @@ packages=(
   libgtest-dev libgmock-dev
   libbenchmark-dev
   libmosquitto-dev mosquitto mosquitto-clients
+  # The networked sync tests' clustered broker: three nodes with MQTT listeners.
+  nats-server
   openssl
   postgresql-15 libpq-dev
 )

@@ -29,6 +29,12 @@ std::string instanceIdOf(const NetworkSyncServer::Options& options) {
     return std::string(host) + "-" + std::to_string(::getpid());
 }
 
+// The three request topics (and the server's own token) are the levels
+// under the root. One subscription takes them all, so that the broker hands
+// them over in the order each client published them: a client's changes
+// must come after its subscription, and a broker keeps order only within a
+// subscription (NATS, for one, keeps each subscription's queue apart).
+constexpr const char* kRequestTopics = "/+";
 }  // namespace
 
 NetworkSyncServer::NetworkSyncServer(const Options& options)
@@ -42,10 +48,7 @@ NetworkSyncServer::NetworkSyncServer(const Options& options)
                      },
                      nullptr, nullptr}) {
     if (postgres != nullptr) leases = makeLeases(options);
-    for (const char* topic : {protocol::TOPIC_CHANGE_RECORD, protocol::TOPIC_SUBSCRIBE_COLLECTION,
-                              protocol::TOPIC_SNAPSHOT}) {
-        connection.subscribe(topic);
-    }
+    connection.subscribe(kRequestTopics);
 }
 
 NetworkSyncServer::~NetworkSyncServer() {
@@ -105,6 +108,7 @@ void NetworkSyncServer::afterLeaseRound(bool acquired) {
 }
 
 void NetworkSyncServer::handleMessage(const std::string& topic, const std::vector<unsigned char>& payload) {
+    if (topic == mqtt::TOPIC_SERVER_ONLINE) return;  // tokens: its own, and other instances'
     std::optional<SessionKey> key = requestKey(topic, payload);
     if (key && leases && !serves(key->second)) return;
     bool transient = false;

@@ -1,6 +1,7 @@
 // The server tier past one machine: tessarine-server instances sharing one
 // PostgreSQL database, stores in processes of their own (tessarine_sync_device),
-// a broker; instances and the database killed mid-stream. And the few
+// a mosquitto broker or a cluster of three NATS nodes (instance i and store i
+// on node i); instances, a node and the database killed mid-stream. And the few
 // guarantees of the PostgreSQL storage and its leases that those scenarios
 // cannot single out.
 #include <gtest/gtest.h>
@@ -15,6 +16,7 @@
 
 #include "ChildProcess.h"
 #include "MqttBroker.h"
+#include "NatsCluster.h"
 #include "PostgresServer.h"
 #include "SyncDevice.h"
 #include "TestSupport.h"
@@ -45,26 +47,58 @@ std::vector<std::string> readLines(const std::string& path) {
 
 class ServerTierTest : public ::testing::Test {
 protected:
-    void SetUp() override {
-        postgres.start();
-        broker.start();
+    void SetUp() override { postgres.start(); }
+    // Starts the broker: one mosquitto, or the NATS cluster.
+    void startBroker(bool nats) {
+        if (nats) {
+            cluster = std::make_unique<testsupport::NatsCluster>(dir);
+            cluster->start();
+        } else {
+            broker = std::make_unique<testsupport::MqttBroker>(dir);
+            broker->start();
+        }
     }
-    void startInstance(const std::string& name) {
-        instances[name] = std::make_unique<ChildProcess>(
-            TESSARINE_SERVER_PROGRAM,
-            std::vector<std::string>{"--broker-port", std::to_string(broker.port), "--postgres", postgres.conninfo(),
-                                     "--instance", name, "--lease-ms", kLeaseMs},
-            TESSARINE_TEST_EMULATOR);
+    // The broker port for the i-th instance or store.
+    int port(size_t i) const { return cluster ? cluster->port(i % testsupport::NatsCluster::kNodes) : broker->port; }
+    void startInstances(const std::vector<std::string>& names) {
+        for (size_t i = 0; i < names.size(); ++i) {
+            instances[names[i]] = std::make_unique<ChildProcess>(
+                TESSARINE_SERVER_PROGRAM,
+                std::vector<std::string>{"--broker-port", std::to_string(port(i)), "--postgres", postgres.conninfo(),
+                                         "--instance", names[i], "--lease-ms", kLeaseMs},
+                TESSARINE_TEST_EMULATOR);
+            instanceIndex[names[i]] = i;
+        }
     }
     void startDevices() {
         for (const std::string tag : {"a", "b", "c"}) {
             devices.push_back(std::make_unique<ChildProcess>(
                 TESSARINE_SYNC_DEVICE,
-                std::vector<std::string>{dir.file(tag + ".db"), std::to_string(broker.port), tag,
+                std::vector<std::string>{dir.file(tag + ".db"), std::to_string(port(tags.size())), tag,
                                          std::to_string(kWrites), std::to_string(kPauseMs), dir.file(tag + ".state")},
                 TESSARINE_TEST_EMULATOR));
             tags.push_back(tag);
         }
+    }
+    // Streams until the serving instance is killed and another one took
+    // over; then all converge with a complete log.
+    void killServingInstanceMidStream() {
+        startInstances({"one", "two", "three"});
+        startDevices();
+        ASSERT_TRUE(waitUntil([&] { return changesLogged() >= 10; }));
+        std::string holder = leaseHolder();
+        ASSERT_EQ(1u, instances.count(holder)) << holder;
+        instances[holder]->kill(SIGKILL);
+        instances[holder]->wait();
+
+        int64_t beforeTakeover = changesLogged();
+        ASSERT_TRUE(waitUntil([&] { return changesLogged() >= beforeTakeover + 10; }, kConvergeDeadline));
+        std::string successor = leaseHolder();
+        EXPECT_NE(holder, successor);
+        EXPECT_EQ(1u, instances.count(successor)) << successor;
+        ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
+        expectLogComplete();
+        stopDevices();
     }
     // The rows of a query, columns joined by "|"; empty while the database
     // is away.
@@ -153,34 +187,45 @@ protected:
 
     TempDir dir;
     testsupport::PostgresServer postgres;
-    testsupport::MqttBroker broker{dir};
+    std::unique_ptr<testsupport::MqttBroker> broker;
+    std::unique_ptr<testsupport::NatsCluster> cluster;
     std::unique_ptr<ts::server::PgConnection> reader;  // reconnects by itself after a restart
     std::map<std::string, std::unique_ptr<ChildProcess>> instances;
+    std::map<std::string, size_t> instanceIndex;
     std::vector<std::unique_ptr<ChildProcess>> devices;
     std::vector<std::string> tags;
 };
 
 TEST_F(ServerTierTest, ThreeStoresConvergeWhenTheServingInstanceIsKilledMidStream) {
-    for (const char* name : {"one", "two", "three"}) startInstance(name);
+    startBroker(false);
+    killServingInstanceMidStream();
+}
+
+TEST_F(ServerTierTest, StoresOnANatsClusterConvergeWhenTheServingInstanceIsKilledMidStream) {
+    startBroker(true);
+    killServingInstanceMidStream();
+}
+
+TEST_F(ServerTierTest, StoresOnANatsClusterConvergeWhenTheServingInstancesNodeIsKilledMidStream) {
+    startBroker(true);
+    startInstances({"one", "two", "three"});
     startDevices();
     ASSERT_TRUE(waitUntil([&] { return changesLogged() >= 10; }));
     std::string holder = leaseHolder();
-    ASSERT_EQ(1u, instances.count(holder)) << holder;
-    instances[holder]->kill(SIGKILL);
-    instances[holder]->wait();
-
-    int64_t beforeTakeover = changesLogged();
-    ASSERT_TRUE(waitUntil([&] { return changesLogged() >= beforeTakeover + 10; }, kConvergeDeadline));
-    std::string successor = leaseHolder();
-    EXPECT_NE(holder, successor);
-    EXPECT_EQ(1u, instances.count(successor)) << successor;
+    ASSERT_EQ(1u, instanceIndex.count(holder)) << holder;
+    size_t node = instanceIndex[holder];
+    cluster->kill(node);
+    // Cut off from its clients, the instance lets its lease lapse.
+    ASSERT_TRUE(waitUntil([&] { return !leaseHolder().empty() && leaseHolder() != holder; }, kConvergeDeadline));
+    cluster->start(node);
     ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
     expectLogComplete();
     stopDevices();
 }
 
 TEST_F(ServerTierTest, StoresConvergeWhenPostgresIsKilledMidStreamAndStartedAgain) {
-    for (const char* name : {"one", "two"}) startInstance(name);
+    startBroker(false);
+    startInstances({"one", "two"});
     startDevices();
     ASSERT_TRUE(waitUntil([&] { return changesLogged() >= 10; }));
     postgres.stop(SIGQUIT);  // at once, as a crash: recovery at the next start
