@@ -4,7 +4,7 @@
 // kCollections collections, with
 //   - server_tier/sqlite: one tessarine-server instance on its SQLite file
 //     (the default);
-//   - server_tier/postgres/N: N instances sharing one PostgreSQL database
+//   - server_tier/ours/N: N instances sharing one PostgreSQL database
 //     (fsync on, as SQLite's synchronous=FULL), the collections spread over
 //     them by their leases.
 // Broker, database and instances all run on this machine, so the figures
@@ -144,7 +144,7 @@ void throughput(benchmark::State& state, int instances) {
 const bool registered = [] {
     add("server_tier/sqlite", [](benchmark::State& s) { throughput(s, 0); })->Iterations(kIterations);
     for (int instances : {1, 2, 3}) {
-        add("server_tier/postgres/" + std::to_string(instances),
+        add("server_tier/ours/" + std::to_string(instances),
             [instances](benchmark::State& s) { throughput(s, instances); })
             ->Iterations(kIterations);
     }

@@ -108,7 +108,7 @@ void CollectionLeases::round() {
     try {
         std::set<std::string> nowHeld;
         int64_t liveInstances = renew(nowHeld);
-        std::set<std::string> taken = take(candidates(liveInstances));
+        std::set<std::string> taken = take(candidates(liveInstances, servedElsewhere()));
         nowHeld.insert(taken.begin(), taken.end());
         acquired = settle(nowHeld, roundStart);
         if (std::optional<std::string> surplus = surplusOf(liveInstances)) handOver(*surplus);
@@ -150,29 +150,57 @@ int64_t CollectionLeases::renew(std::set<std::string>& renewed) {
 
 std::set<std::string> CollectionLeases::take(const std::vector<std::string>& collections) {
     if (collections.empty()) return {};
-    // Sorted, so that instances taking several leases lock rows in one order.
-    return collectionsOf(connection.exec(
+    const std::string names = arrayLiteral(collections);
+    const int64_t durationMs = timings.duration.count();
+    // Leases never taken: new rows, in one order so that instances inserting
+    // the same names wait for each other rather than deadlock.
+    std::set<std::string> taken = collectionsOf(connection.exec(
         "INSERT INTO tessarine_leases (collection, holder, expires_at)"
         " SELECT name, $2, now() + $3::bigint * interval '1 millisecond'"
-        " FROM unnest($1::text[]) AS name ORDER BY name"
-        " ON CONFLICT (collection) DO UPDATE SET holder = EXCLUDED.holder, expires_at = EXCLUDED.expires_at"
-        " WHERE tessarine_leases.expires_at <= now() OR tessarine_leases.holder = EXCLUDED.holder"
+        " FROM unnest($1::text[]) AS name ORDER BY name ON CONFLICT (collection) DO NOTHING RETURNING collection",
+        {names, instanceId, durationMs}));
+    // Expired leases (or this instance's own). Rows locked elsewhere (a
+    // commit of the holder in progress, another instance taking them) are
+    // skipped for this round rather than waited for: waiting would hold this
+    // round up and could close a cycle of waits with other instances.
+    std::set<std::string> expired = collectionsOf(connection.exec(
+        "UPDATE tessarine_leases SET holder = $2, expires_at = now() + $3::bigint * interval '1 millisecond'"
+        " WHERE collection IN (SELECT collection FROM tessarine_leases WHERE collection = ANY($1::text[])"
+        " AND (expires_at <= now() OR holder = $2) ORDER BY collection FOR UPDATE SKIP LOCKED)"
         " RETURNING collection",
-        {arrayLiteral(collections), instanceId, static_cast<int64_t>(timings.duration.count())}));
+        {names, instanceId, durationMs}));
+    taken.insert(expired.begin(), expired.end());
+    return taken;
 }
 
-std::vector<std::string> CollectionLeases::candidates(int64_t liveInstances) {
+std::set<std::string> CollectionLeases::servedElsewhere() {
+    std::vector<std::string> waiting;
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        for (const auto& entry : waitingRounds) waiting.push_back(entry.first);
+    }
+    if (waiting.empty()) return {};
+    return collectionsOf(connection.exec(
+        "SELECT collection FROM tessarine_leases WHERE collection = ANY($1::text[]) AND expires_at > now()"
+        " AND holder <> $2",
+        {arrayLiteral(waiting), instanceId}));
+}
+
+std::vector<std::string> CollectionLeases::candidates(int64_t liveInstances, const std::set<std::string>& served) {
     std::lock_guard<std::mutex> lock(mutex);
     int64_t room = shareOf(liveInstances) - static_cast<int64_t>(held.size());
     std::vector<std::string> free;
     std::vector<std::string> overdue;
     for (auto& [name, rounds] : waitingRounds) {
+        if (served.count(name) != 0) {
+            rounds = 1;  // served: nothing to do, and no longer new
+            continue;
+        }
         (rounds >= kMaxWaitRounds ? overdue : free).push_back(name);
         ++rounds;
     }
     std::shuffle(free.begin(), free.end(), random);
-    if (room > 0 && static_cast<size_t>(room) < free.size()) free.resize(static_cast<size_t>(room));
-    if (room <= 0) free.clear();
+    free.resize(static_cast<size_t>(std::clamp<int64_t>(room, 0, static_cast<int64_t>(free.size()))));
     free.insert(free.end(), overdue.begin(), overdue.end());
     return free;
 }

@@ -13,8 +13,9 @@
 // the collections it knows of divided by the live instances, rounded up,
 // picked at random among the free ones; one that serves more than its share
 // (it started first, say) hands one collection over per round, ending its
-// lease for another instance to take. A collection left unserved for
-// kMaxWaitRounds rounds is taken by whoever sees it, share or not. Leases
+// lease for another instance to take. A collection that nobody has served
+// for kMaxWaitRounds rounds in a row is taken by whoever sees it, share or
+// not. Leases
 // are renewed only while mayRenew() (the instance is connected to its
 // broker): an instance cut off from its clients lets its collections go
 // within a lease's duration.
@@ -98,8 +99,10 @@ private:
     // instances, itself included.
     int64_t renew(std::set<std::string>& renewed);
     std::set<std::string> take(const std::vector<std::string>& candidates);
-    // Collections to try this round; counts a round waited for all.
-    std::vector<std::string> candidates(int64_t liveInstances);
+    // The noticed collections that another instance serves now.
+    std::set<std::string> servedElsewhere();
+    // Collections to try this round; counts a round unserved for the others.
+    std::vector<std::string> candidates(int64_t liveInstances, const std::set<std::string>& served);
     int64_t shareOf(int64_t liveInstances) const;  // under the lock
     // A collection to hand over, already given up here; empty when none.
     std::optional<std::string> surplusOf(int64_t liveInstances);
@@ -116,7 +119,9 @@ private:
     mutable std::mutex mutex;  // guards the members below
     std::condition_variable wake;
     std::map<std::string, Held> held;
-    std::map<std::string, int> waitingRounds;  // noticed collections not held, and rounds waited
+    // Noticed collections not held here, and for how many rounds in a row
+    // nobody served them (0: new).
+    std::map<std::string, int> waitingRounds;
     uint64_t lastEpoch = 0;
     bool stopping = false;
     bool failing = false;  // the last round failed (logged once)
