@@ -36,9 +36,8 @@
 // epoch() and noticed() may be called from any thread; they take the lock
 // briefly. start() and stop() are not for the handlers.
 //
-// Errors: the constructor throws PgError when the database cannot be
-// reached. A round that fails (database down) is logged and retried; its
-// leases lapse meanwhile.
+// Errors: none thrown. A round that fails (database down) is logged and
+// retried; its leases lapse meanwhile.
 #pragma once
 
 #include <chrono>

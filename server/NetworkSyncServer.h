@@ -51,9 +51,10 @@
 // disconnects and joins the network thread.
 //
 // Errors: the constructor throws when the data file cannot be opened
-// (lumivale::sqlite::SQLiteException), the database cannot be reached
-// (PgError), or the broker options cannot be used, or name PostgreSQL in a
-// build without it (std::runtime_error).
+// (lumivale::sqlite::SQLiteException), or the broker options cannot be
+// used, or name PostgreSQL in a build without it (std::runtime_error). A
+// PostgreSQL database that cannot be reached is tried again (logged), at
+// start as later.
 #pragma once
 
 #include <atomic>

@@ -68,7 +68,13 @@ std::vector<unsigned char> PgResult::bytes(int row, int column) const {
     return data;
 }
 
-PgConnection::PgConnection(std::string info) : conninfo(std::move(info)) { connect(); }
+PgConnection::PgConnection(std::string info) : conninfo(std::move(info)) {
+    try {
+        connect();
+    } catch (const PgError&) {
+        // Logged; the first operation tries again.
+    }
+}
 
 PgConnection::~PgConnection() { PQfinish(connection); }
 

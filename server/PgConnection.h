@@ -86,7 +86,8 @@ public:
     static constexpr std::chrono::milliseconds kMinRetryDelay{100};
     static constexpr std::chrono::milliseconds kMaxRetryDelay{1000};
 
-    // Connects now; throws PgError when the database cannot be reached.
+    // Connects now; when the database cannot be reached (logged), the first
+    // operation tries again.
     explicit PgConnection(std::string conninfo);
     ~PgConnection();
     PgConnection(const PgConnection&) = delete;

@@ -1,5 +1,6 @@
 #include "server/PostgresLogStorage.h"
 
+#include "platform/Log.h"
 #include "server/PostgresSchema.h"
 
 namespace lumivale {
@@ -8,6 +9,8 @@ namespace server {
 
 namespace {
 
+constexpr const char* kTag = "tessarine_server";
+constexpr int kWarningPriority = 5;
 constexpr const char* kSelectChanges =
     "SELECT client_id, collection, version_id, primary_key, sort_key, type, blob, sequence FROM tessarine_changes ";
 constexpr const char* kSelectObjects =
@@ -54,12 +57,24 @@ uint64_t readLast(const PgResult& result) {
 
 PostgresLogStorage::PostgresLogStorage(const std::string& conninfo, std::string holder)
     : connection(conninfo), leaseHolder(std::move(holder)) {
+    try {
+        ensureSchema();
+    } catch (const PgError& e) {
+        lv_printLog(kWarningPriority, kTag, "PostgresLogStorage: cannot create the tables yet (%s); retrying",
+                    e.what());
+    }
+}
+
+void PostgresLogStorage::ensureSchema() {
+    if (schemaCreated) return;
     createPostgresSchema(connection);
+    schemaCreated = true;
 }
 
 template <typename Body>
 auto PostgresLogStorage::counted(Body body) -> decltype(body()) {
     try {
+        ensureSchema();
         return body();
     } catch (const PgError&) {
         ++failureCount;

@@ -17,9 +17,10 @@
 // Objects are ordered by the bytes of their sort keys (COLLATE "C"), as
 // every other storage orders them, whatever the database's locale.
 //
-// Errors: PgError from the constructor when the database cannot be reached,
-// and from any operation that the database fails (the connection then
-// reconnects on a later call, see PgConnection); LeaseLost from append. A
+// Errors: PgError from any operation that the database fails (the
+// connection then reconnects on a later call, see PgConnection; the tables
+// are created by the first operation that reaches the database, so a
+// storage may be made while the database is away); LeaseLost from append. A
 // failed append leaves the database as it was.
 //
 // Threads: one thread at a time (its owner's lock), except failures(),
@@ -46,7 +47,8 @@ public:
     };
 
     // Connects with the libpq connection string and creates the tables that
-    // are missing. leaseHolder: see above; empty for a storage of its own.
+    // are missing (or leaves both to the first operation, see Errors).
+    // leaseHolder: see above; empty for a storage of its own.
     explicit PostgresLogStorage(const std::string& conninfo, std::string leaseHolder = "");
 
     std::optional<SyncProtocol::Delta> findAccepted(const SyncProtocol::Delta& change) override;
@@ -62,13 +64,15 @@ public:
     uint64_t failures() const { return failureCount.load(); }
 
 private:
-    // Runs body, counting a PgError it throws.
+    void ensureSchema();
+    // Runs body (after creating the tables if need be), counting a PgError.
     template <typename Body>
     auto counted(Body body) -> decltype(body());
     void appendInTransaction(const SyncProtocol::Delta& change, SyncProtocol::Delta& logged);
 
     PgConnection connection;
     const std::string leaseHolder;
+    bool schemaCreated = false;
     std::atomic<uint64_t> failureCount{0};
 };
 
