@@ -6,10 +6,11 @@
 // It subscribes to the three request topics of tessarine/Protocol.h, with
 // one subscription so that each client's requests arrive in the order it
 // sent them on any MQTT 3.1.1 broker (mosquitto, a NATS cluster's MQTT
-// listeners), and answers each client on mqtt::clientTopic(client id), QoS 1. Every time it
-// connects to the broker it publishes a new retained token on
-// mqtt::TOPIC_SERVER_ONLINE, after its subscriptions, so that clients resend
-// whatever it may have lost meanwhile (see MqttTransport).
+// listeners), and answers each client on mqtt::clientTopic(client id), QoS
+// 1. Every time it connects to the broker it publishes a new retained token on
+// mqtt::TOPIC_SERVER_ONLINE, once the broker has granted its subscription,
+// so that clients resend whatever it may have lost meanwhile (see
+// MqttTransport).
 //
 // Sessions: a store's subscription to a collection starts a new session for
 // that (client id, collection): the store subscribes again on every

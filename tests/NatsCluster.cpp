@@ -150,22 +150,23 @@ void NatsCluster::start(size_t node) {
 void NatsCluster::kill(size_t node) { nodes.at(node).process.reset(); }
 
 void NatsCluster::waitReady() {
-    std::vector<std::pair<size_t, int>> running;
+    std::vector<std::pair<size_t, int>> live;  // (node, MQTT port)
     for (size_t i = 0; i < kNodes; ++i) {
-        if (this->running(i)) running.emplace_back(i, nodes[i].mqttPort);
+        if (running(i)) live.emplace_back(i, nodes[i].mqttPort);
     }
-    Probe probe(running);
+    Probe probe(live);
     bool exited = false;
     bool ready = waitUntil(
         [&] {
-            for (const auto& entry : running) exited = exited || nodes[entry.first].process->hasExited();
+            for (const auto& entry : live) exited = exited || nodes[entry.first].process->hasExited();
             return exited || probe.poll();
         },
         kReadyDeadline);
     if (!ready || exited) {
         std::string logs;
-        for (const auto& [node, port] : running) logs += "\nnode " + std::to_string(node) + ":\n" + logTail(node);
-        throw std::runtime_error("the NATS cluster did not become ready for MQTT" + logs);
+        for (const auto& entry : live) logs += "\nnode " + std::to_string(entry.first) + ":\n" + logTail(entry.first);
+        throw std::runtime_error(exited ? "a NATS node exited" + logs
+                                        : "the NATS cluster did not become ready for MQTT" + logs);
     }
 }
 

@@ -38,6 +38,9 @@ using testsupport::waitUntil;
 
 const char* const kCollection = "net:notes";
 constexpr std::chrono::seconds kConvergeDeadline(30);
+// A NATS node refuses connections and subscriptions for seconds at a time
+// while JetStream elects leaders, more so on a loaded machine.
+constexpr std::chrono::seconds kClusterDeadline(90);
 
 std::vector<std::string> readLines(const std::string& path) {
     std::vector<std::string> lines;
@@ -226,6 +229,14 @@ protected:
             startDevice(nodeTags[node], writes, pauseMs, cluster.port(node));
         }
     }
+    // describe() and the end of each node's log.
+    std::string describeCluster() {
+        std::string text = describe();
+        for (size_t node = 0; node < NatsCluster::kNodes; ++node) {
+            text += "\nNATS node " + std::to_string(node) + ":\n" + cluster.logTail(node);
+        }
+        return text;
+    }
 
     NatsCluster cluster{dir};
 };
@@ -234,7 +245,7 @@ TEST_F(ClusteredBrokerTest, StoresOnDifferentNodesConvergeThroughOneServer) {
     cluster.start();
     auto server = startServer(cluster.port(0));
     startDevices(12, 0);
-    ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
+    ASSERT_TRUE(waitUntil([&] { return converged(); }, kClusterDeadline)) << describeCluster();
     expectLogComplete();
     stopDevices();
     server->kill(SIGTERM);
@@ -245,10 +256,10 @@ TEST_F(ClusteredBrokerTest, NodeOfServerAndStoreKilledMidStreamLosesNoPersistedC
     cluster.start();
     auto server = startServer(cluster.port(0));
     startDevices(40, 25);
-    ASSERT_TRUE(waitUntil([&] { return changesLogged() >= 10; })) << cluster.logTail(0);
+    ASSERT_TRUE(waitUntil([&] { return changesLogged() >= 10; }, kClusterDeadline)) << cluster.logTail(0);
     cluster.kill(0);
     cluster.start(0);
-    ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
+    ASSERT_TRUE(waitUntil([&] { return converged(); }, kClusterDeadline)) << describeCluster();
     expectLogComplete();
     stopDevices();
 }
@@ -297,7 +308,7 @@ TEST_F(ClusteredBrokerTest, ClientTopicsCarryAnyClientIdAcrossNodes) {
         }
         for (const std::string& id : clientIds) sent += sender.publish(ts::mqtt::clientTopic(id), {1}) != 0 ? 1 : 0;
         return false;
-    })) << received.size();
+    }, kClusterDeadline)) << received.size();
     EXPECT_EQ(expected.size(), clientIds.size());
 }
 
