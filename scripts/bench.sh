@@ -48,6 +48,9 @@ run sync_metrics resend_bench --benchmark_filter='^sync_metrics/'
 run scale scale_bench
 # Networked sync through a mosquitto broker on loopback that the program starts.
 run network network_bench
+# The server tier: instances on SQLite and on a shared PostgreSQL that the
+# program starts (initdb in a temporary folder), with a mosquitto broker.
+run server_tier server_tier_bench
 # The memory of one resend of 100 000 queued deltas, each side in a process of
 # its own so that neither's peak hides the other's.
 run resend_memory_ours resend_bench --benchmark_filter='^resend_memory/ours/100000' --benchmark_repetitions=1

@@ -28,6 +28,8 @@ LABELS = {
     "scale_range_query": "range query at {size} objects (per row)",
     "network_latency": "save to callback on another store, via broker + server (floor: in-process server)",
     "server_throughput": "server, 1000 changes (per change; floor: same rules and file, no broker)",
+    "server_tier": "server tier, {size} instance(s) on PostgreSQL, 1000 changes from a store (per change; "
+                   "sqlite: one instance on its file)",
 }
 ORDER = list(LABELS)
 UNIT_SECONDS = {"ns": 1e-9, "us": 1e-6, "ms": 1e-3, "s": 1.0}

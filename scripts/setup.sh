@@ -22,7 +22,10 @@ packages=(
   libgtest-dev libgmock-dev
   libbenchmark-dev
   libmosquitto-dev mosquitto mosquitto-clients
+  # The networked sync tests' clustered broker: three nodes with MQTT listeners.
+  nats-server
   openssl
+  postgresql-15 libpq-dev
 )
 # The Java API and its checks (plain, asan and clang configurations): the JDK,
 # JUnit and npm for the Kotlin compiler; Debian's host liblog for the Android

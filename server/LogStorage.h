@@ -35,8 +35,10 @@ public:
 
     // Logs the change under the collection's next sequence number and
     // applies it to the objects; returns it with that number. When append
-    // returns, the change is as durable as the storage can make it.
-    virtual SyncProtocol::Delta append(const SyncProtocol::Delta& change) = 0;
+    // returns, the change is as durable as the storage can make it. Empty
+    // when the change turns out to be logged already (a storage shared by
+    // several servers: another one logged it since findAccepted looked).
+    virtual std::optional<SyncProtocol::Delta> append(const SyncProtocol::Delta& change) = 0;
 
     // The logged changes with sequence numbers above sequenceNumber, in order.
     virtual std::vector<SyncProtocol::Delta> changesAfter(const std::string& collectionName,
@@ -52,6 +54,18 @@ public:
 
     // The current objects, ascending by sort key, equal sort keys by primary key.
     virtual std::vector<SyncProtocol::TessarineObject> objects(const std::string& collectionName) = 0;
+
+    // The objects with the last sequence number and the client's highest
+    // version id, as of one moment. A storage that others write at the same
+    // time reads them in one transaction.
+    virtual SyncProtocol::Snapshot snapshot(const std::string& collectionName, const std::string& clientId) {
+        SyncProtocol::Snapshot result;
+        result.collectionName = collectionName;
+        result.objects = objects(collectionName);
+        result.sequenceNumber = lastSequenceNumber(collectionName);
+        result.versionId = highestVersionId(collectionName, clientId).value_or(0);
+        return result;
+    }
 };
 
 }  // namespace server

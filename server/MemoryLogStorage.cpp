@@ -20,7 +20,7 @@ std::optional<SyncProtocol::Delta> MemoryLogStorage::findAccepted(const SyncProt
     return collection->log[earlier->second - 1];
 }
 
-SyncProtocol::Delta MemoryLogStorage::append(const SyncProtocol::Delta& change) {
+std::optional<SyncProtocol::Delta> MemoryLogStorage::append(const SyncProtocol::Delta& change) {
     Collection& collection = collections[change.collectionName];
     SyncProtocol::Delta logged = change;
     logged.sequenceNumber = collection.log.size() + 1;

@@ -16,7 +16,7 @@ namespace server {
 class MemoryLogStorage : public LogStorage {
 public:
     std::optional<SyncProtocol::Delta> findAccepted(const SyncProtocol::Delta& change) override;
-    SyncProtocol::Delta append(const SyncProtocol::Delta& change) override;
+    std::optional<SyncProtocol::Delta> append(const SyncProtocol::Delta& change) override;
     std::vector<SyncProtocol::Delta> changesAfter(const std::string& collectionName, uint64_t sequenceNumber) override;
     uint64_t lastSequenceNumber(const std::string& collectionName) override;
     std::optional<uint64_t> highestVersionId(const std::string& collectionName, const std::string& clientId) override;

@@ -82,7 +82,7 @@ std::optional<SyncProtocol::Delta> SqliteLogStorage::findAccepted(const SyncProt
     return readChange(selectAccepted);
 }
 
-SyncProtocol::Delta SqliteLogStorage::append(const SyncProtocol::Delta& change) {
+std::optional<SyncProtocol::Delta> SqliteLogStorage::append(const SyncProtocol::Delta& change) {
     SyncProtocol::Delta logged = change;
     database->runInTransaction(
         [&] {

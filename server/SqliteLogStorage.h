@@ -32,7 +32,7 @@ public:
     explicit SqliteLogStorage(const std::string& path);
 
     std::optional<SyncProtocol::Delta> findAccepted(const SyncProtocol::Delta& change) override;
-    SyncProtocol::Delta append(const SyncProtocol::Delta& change) override;
+    std::optional<SyncProtocol::Delta> append(const SyncProtocol::Delta& change) override;
     std::vector<SyncProtocol::Delta> changesAfter(const std::string& collectionName, uint64_t sequenceNumber) override;
     uint64_t lastSequenceNumber(const std::string& collectionName) override;
     std::optional<uint64_t> highestVersionId(const std::string& collectionName, const std::string& clientId) override;

@@ -78,7 +78,11 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
     SyncProtocol::Delta change = protocol::makeTessarineDelta(payload, 0);
     requireValidCollectionName(change.collectionName);
     if (change.clientId.empty()) throw std::runtime_error("change without a client id");
-    if (std::optional<SyncProtocol::Delta> earlier = storage->findAccepted(change)) {
+    std::optional<SyncProtocol::Delta> earlier = storage->findAccepted(change);
+    std::optional<SyncProtocol::Delta> appended = earlier ? std::nullopt : storage->append(change);
+    if (!appended) {
+        if (!earlier) earlier = storage->findAccepted(change);
+        if (!earlier) throw std::runtime_error("the storage refused the change as logged but does not hold it");
         // A session that follows the collection has been sent every change
         // up to the last one, so the echo carries that number: a client
         // moves its sequence number forward only, and never asks for (and
@@ -88,7 +92,7 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
         }
         return receipt(Outcome::CHANGE_ECHOED, change.collectionName);
     }
-    SyncProtocol::Delta logged = storage->append(change);
+    const SyncProtocol::Delta& logged = *appended;
     for (const auto& entry : sessions) {
         if (entry.second.subscriptions.count(change.collectionName) != 0) {
             sendChanges(entry.second, {logged}, logged.sequenceNumber);
@@ -160,12 +164,7 @@ std::vector<SyncProtocol::Delta> SyncServer::catchUpAfter(const std::string& col
 // The current objects with the last sequence number and the client's
 // highest accepted version id.
 SyncProtocol::Snapshot SyncServer::snapshotFor(const std::string& collectionName, const std::string& clientId) const {
-    SyncProtocol::Snapshot snapshot;
-    snapshot.collectionName = collectionName;
-    snapshot.objects = storage->objects(collectionName);
-    snapshot.sequenceNumber = storage->lastSequenceNumber(collectionName);
-    snapshot.versionId = storage->highestVersionId(collectionName, clientId).value_or(0);
-    return snapshot;
+    return storage->snapshot(collectionName, clientId);
 }
 
 void SyncServer::sendChanges(const Session& session, const std::vector<SyncProtocol::Delta>& changes,

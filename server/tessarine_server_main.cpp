@@ -1,11 +1,13 @@
 // tessarine-server: the networked sync server as a program. See usage().
 #include <signal.h>
 
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <exception>
 #include <map>
+#include <stdexcept>
 #include <string>
 
 #include "platform/Log.h"
@@ -22,7 +24,10 @@ void usage(const char* program) {
         "usage: %s [options]\n"
         "\n"
         "Serves Tessarine stores through an MQTT broker, keeping every accepted change in a\n"
-        "SQLite file. SIGTERM or SIGINT end it cleanly; after a crash it serves on from the file.\n"
+        "SQLite file, or in a PostgreSQL database that several instances share (each\n"
+        "collection is served by the instance holding its lease; when an instance dies the\n"
+        "others take its collections over). SIGTERM or SIGINT end it cleanly; after a crash\n"
+        "it serves on from the file or the database.\n"
         "\n"
         "  --broker-host HOST        broker address (default 127.0.0.1)\n"
         "  --broker-port PORT        broker port (default 1883)\n"
@@ -32,8 +37,19 @@ void usage(const char* program) {
         "  --keep-alive SECONDS      MQTT keep-alive (default 30)\n"
         "  --max-payload-bytes N     larger payloads are logged and dropped (default 16777216)\n"
         "  --data PATH               the server's SQLite file (default tessarine-server.db)\n"
+        "  --postgres CONNINFO       keep the changes in this PostgreSQL database instead\n"
+        "                            (a libpq connection string, e.g. \"host=db dbname=tessarine\")\n"
+        "  --instance NAME           this instance's name in the leases (default host-pid)\n"
+        "  --lease-ms N              how long a lease lasts unrenewed (default 3000); it is\n"
+        "                            renewed every third of that\n"
         "  --verbose                 also log each accepted change\n",
         program);
+}
+
+lumivale::tessarine::server::CollectionLeases::Timings leaseTimings(int durationMs) {
+    constexpr int kRenewalsPerLease = 3;
+    if (durationMs < kRenewalsPerLease) throw std::invalid_argument("--lease-ms must be at least 3");
+    return {std::chrono::milliseconds(durationMs / kRenewalsPerLease), std::chrono::milliseconds(durationMs)};
 }
 
 // Parses the flags into options; false (after a message) for a bad command line.
@@ -62,6 +78,9 @@ bool parse(int argc, char** argv, NetworkSyncServer::Options& options, bool& ver
             else if (flag == "--keep-alive") options.broker.keepAliveSeconds = std::stoi(value);
             else if (flag == "--max-payload-bytes") options.broker.maxPayloadBytes = std::stoull(value);
             else if (flag == "--data") options.dataPath = value;
+            else if (flag == "--postgres") options.postgres = value;
+            else if (flag == "--instance") options.instanceId = value;
+            else if (flag == "--lease-ms") options.leaseTimings = leaseTimings(std::stoi(value));
             else throw std::invalid_argument("unknown option " + flag);
         }
     } catch (const std::exception& e) {
@@ -99,7 +118,8 @@ int main(int argc, char** argv) {
         NetworkSyncServer server(options);
         server.start();
         lv_printLog(kInfoPriority, "tessarine_server", "tessarine-server: serving %s through %s:%d",
-                    options.dataPath.c_str(), options.broker.host.c_str(), options.broker.port);
+                    options.postgres.empty() ? options.dataPath.c_str() : "PostgreSQL", options.broker.host.c_str(),
+                    options.broker.port);
         int signal = 0;
         sigwait(&stopSignals, &signal);
         lv_printLog(kInfoPriority, "tessarine_server", "tessarine-server: stopping on signal %d", signal);

@@ -51,6 +51,12 @@ public:
 
     void kill(int signal) { ::kill(pid, signal); }
 
+    // True once the child has ended (and then reaped); does not wait.
+    bool hasExited() {
+        if (!reaped && waitpid(pid, &status, WNOHANG) == pid) reaped = true;
+        return reaped;
+    }
+
     // Waits for the child to end and returns its wait status (see waitpid).
     int wait() {
         if (!reaped) {

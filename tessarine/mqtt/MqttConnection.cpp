@@ -15,6 +15,13 @@ namespace {
 
 constexpr const char* kTag = "tessarine";
 constexpr int kQos = 1;
+// What a SUBACK grants for a subscription the broker refused.
+constexpr int kRefused = 0x80;
+// A refused subscription is asked for again as soon as the refusal comes,
+// up to this many times per connection: a broker that is still electing its
+// leaders (a NATS node that just joined) refuses for seconds, each refusal
+// taking it tens of milliseconds; one that forbids the topic does so forever.
+constexpr int kMaxSubscribeAttempts = 200;
 
 void initialiseLibrary() {
     static const int once = mosquitto_lib_init();
@@ -27,7 +34,25 @@ void require(int rc, const std::string& what) {
 
 }  // namespace
 
-std::string clientTopic(const std::string& clientId) { return "/tessarine_client/" + clientId; }
+std::string clientTopic(const std::string& clientId) {
+    // Only letters, digits, '-' and '_' go as they are; every other byte as
+    // %XX. Brokers differ in what else a topic level may hold (NATS drops a
+    // connection that publishes a '.' or ' '), and '+', '#' and '/' would
+    // make a client id a wildcard or several levels.
+    static const char kHex[] = "0123456789ABCDEF";
+    std::string topic = "/tessarine_client/";
+    for (unsigned char c : clientId) {
+        bool plain = (c >= 'a' && c <= 'z') || (c >= 'A' && c <= 'Z') || (c >= '0' && c <= '9') || c == '-' || c == '_';
+        if (plain) {
+            topic += static_cast<char>(c);
+        } else {
+            topic += '%';
+            topic += kHex[c >> 4];
+            topic += kHex[c & 0xF];
+        }
+    }
+    return topic;
+}
 
 MqttConnection::MqttConnection(const ConnectionOptions& options, std::string name, Handlers handlers)
     : settings(options), name(std::move(name)), handlers(std::move(handlers)) {
@@ -63,6 +88,7 @@ struct mosquitto* MqttConnection::createClient() {
     mosquitto_disconnect_callback_set(created, &MqttConnection::onDisconnect);
     mosquitto_message_callback_set(created, &MqttConnection::onMessage);
     mosquitto_publish_callback_set(created, &MqttConnection::onPublish);
+    mosquitto_subscribe_callback_set(created, &MqttConnection::onSubscribe);
     return created;
 }
 
@@ -109,7 +135,15 @@ void MqttConnection::subscribe(const std::string& topic) {
         if (!topics.insert(topic).second) return;
     }
     std::shared_lock<std::shared_mutex> lock(clientMutex);
-    if (connected && client != nullptr) mosquitto_subscribe(client, nullptr, topic.c_str(), kQos);
+    if (connected && client != nullptr) requestSubscription(client, topic);
+}
+
+void MqttConnection::requestSubscription(struct mosquitto* mosq, const std::string& topic) {
+    // Held across the call, so that the SUBACK, which may come back before
+    // it returns, finds the topic.
+    std::lock_guard<std::mutex> lock(subscriptionsMutex);
+    int messageId = 0;
+    if (mosquitto_subscribe(mosq, &messageId, topic.c_str(), kQos) == MOSQ_ERR_SUCCESS) awaited[messageId] = topic;
 }
 
 int MqttConnection::publish(const std::string& topic, const std::vector<unsigned char>& payload, bool retain) {
@@ -143,6 +177,45 @@ void MqttConnection::onMessage(struct mosquitto*, void* self, const struct mosqu
     static_cast<MqttConnection*>(self)->handleMessage(*message);
 }
 
+void MqttConnection::onSubscribe(struct mosquitto* mosq, void* self, int messageId, int count, const int* granted) {
+    static_cast<MqttConnection*>(self)->handleSubscribed(mosq, messageId, count > 0 ? granted[0] : kRefused);
+}
+
+void MqttConnection::handleSubscribed(struct mosquitto* mosq, int messageId, int granted) {
+    std::string topic;
+    int attempts = 0;
+    bool announce = false;
+    {
+        std::lock_guard<std::mutex> lock(subscriptionsMutex);
+        auto found = awaited.find(messageId);
+        if (found == awaited.end()) return;
+        topic = std::move(found->second);
+        awaited.erase(found);
+        if (granted == kRefused) {
+            attempts = ++refusals[topic];
+        } else {
+            // Granted after a refusal, once the connection was announced:
+            // what was published to the topic meanwhile is lost, as when
+            // the connection drops, so it is announced again.
+            announce = refusals.erase(topic) != 0 && announced;
+        }
+        announce = announce || (awaited.empty() && !announced);
+    }
+    if (attempts > 0 && attempts < kMaxSubscribeAttempts) {
+        if (attempts == 1) {
+            lv_printLog(5, kTag, "%s: the broker refused the subscription to \"%s\"; asking again", name.c_str(),
+                        topic.c_str());
+        }
+        requestSubscription(mosq, topic);
+        return;
+    }
+    if (attempts > 0) {
+        lv_printLog(6, kTag, "%s: the broker refused the subscription to \"%s\" %d times; giving up on this connection",
+                    name.c_str(), topic.c_str(), attempts);
+    }
+    if (announce) this->announce();
+}
+
 void MqttConnection::onPublish(struct mosquitto*, void* self, int messageId) {
     auto* connection = static_cast<MqttConnection*>(self);
     if (connection->handlers.published) {
@@ -155,16 +228,32 @@ void MqttConnection::handleConnect(struct mosquitto* mosq, int rc) {
         lv_printLog(5, kTag, "%s: connection refused: %s", name.c_str(), mosquitto_connack_string(rc));
         return;
     }
-    // Up first, so that a topic added meanwhile is either in the copy or
-    // subscribed by subscribe() itself.
+    {
+        // A new connection: the last one's answers will not come.
+        std::lock_guard<std::mutex> lock(subscriptionsMutex);
+        awaited.clear();
+        refusals.clear();
+        announced = false;
+    }
+    // Up before the copy, so that a topic added meanwhile is either in the
+    // copy or subscribed by subscribe() itself.
     connected = true;
     std::set<std::string> subscribed;
     {
         std::lock_guard<std::mutex> lock(topicsMutex);
         subscribed = topics;
     }
-    for (const std::string& topic : subscribed) mosquitto_subscribe(mosq, nullptr, topic.c_str(), kQos);
+    for (const std::string& topic : subscribed) requestSubscription(mosq, topic);
     lv_printLog(4, kTag, "%s: connected to %s:%d", name.c_str(), settings.host.c_str(), settings.port);
+    // The answers come on this thread, after this returns.
+    if (subscribed.empty()) announce();
+}
+
+void MqttConnection::announce() {
+    {
+        std::lock_guard<std::mutex> lock(subscriptionsMutex);
+        announced = true;
+    }
     if (handlers.connected) guard("connected", handlers.connected);
 }
 

@@ -5,15 +5,21 @@
 //
 // Handlers (all optional) run on the connection's network thread, one at a
 // time, never under a lock of this class:
-//   - connected: a connection is up and its subscriptions have been asked
-//     for (the broker handles them before anything published after them);
+//   - connected: a connection is up and the broker has answered its
+//     subscriptions (granted, or refused for good), so that what is
+//     published from here on reaches this client; and again when a
+//     subscription the broker refused is granted after all (what was
+//     published to it meanwhile is lost, as when a connection drops);
 //   - message: a message arrived on a subscribed topic (retained: the broker
 //     kept it from before this connection's subscription);
 //   - published: the broker acknowledged the publish with that message id;
 //   - disconnected: the connection went down (or an attempt failed).
-// An exception a handler throws is logged and goes no further. A refused
-// connection (bad credentials, say) is logged under the connection's name
-// ("<name>: connection refused: <reason>") and tried again after the back-off.
+// An exception a handler throws is logged and goes no further. A
+// subscription the broker refuses (a NATS node whose JetStream is not ready
+// yet) is asked for again, up to a limit per connection (the first refusal
+// and giving up are logged). A refused connection (bad credentials, say) is
+// logged under the connection's name ("<name>: connection refused:
+// <reason>") and tried again after the back-off.
 //
 // Threads: every operation may be called from any thread, handlers
 // included, except that start() and stop() must not run at the same time.
@@ -26,6 +32,7 @@
 
 #include <atomic>
 #include <functional>
+#include <map>
 #include <mutex>
 #include <set>
 #include <shared_mutex>
@@ -39,7 +46,10 @@ namespace lumivale {
 namespace tessarine {
 namespace mqtt {
 
-// The topic on which the server publishes a client's payloads.
+// The topic on which the server publishes a client's payloads. Any client
+// id gives a valid topic of one level on every broker (bytes other than
+// letters, digits, '-' and '_' are written %XX), and different ids give
+// different topics.
 std::string clientTopic(const std::string& clientId);
 
 // Retained; the server publishes a new token on it on every connection to
@@ -107,6 +117,14 @@ private:
     static void onDisconnect(struct mosquitto*, void* self, int rc);
     static void onMessage(struct mosquitto*, void* self, const struct mosquitto_message* message);
     static void onPublish(struct mosquitto*, void* self, int messageId);
+    static void onSubscribe(struct mosquitto*, void* self, int messageId, int count, const int* granted);
+    // Subscribes and remembers the topic until the broker answers.
+    void requestSubscription(struct mosquitto* mosq, const std::string& topic);
+    // Asks again for a subscription the broker refused; announces the
+    // connection once every subscription is answered.
+    void handleSubscribed(struct mosquitto* mosq, int messageId, int granted);
+    // Runs the connected handler.
+    void announce();
     void handleConnect(struct mosquitto* mosq, int rc);
     void handleMessage(const struct mosquitto_message& message);
     // Runs a handler, logging what it throws.
@@ -126,6 +144,11 @@ private:
 
     std::mutex topicsMutex;  // guards topics; taken briefly, never across a handler
     std::set<std::string> topics;
+
+    std::mutex subscriptionsMutex;  // guards the three below; held across mosquitto_subscribe only
+    std::map<int, std::string> awaited;  // topic by the message id of its SUBSCRIBE
+    std::map<std::string, int> refusals;  // on this connection, by topic
+    bool announced = false;  // the connected handler ran for this connection
 };
 
 }  // namespace mqtt
