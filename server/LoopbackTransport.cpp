@@ -19,16 +19,15 @@ constexpr uint64_t kToClientSeedOffset = 0x9E3779B97F4A7C15ull;
 
 }  // namespace
 
-LoopbackTransport::LoopbackTransport(std::shared_ptr<SyncServer> server, uint64_t seed)
-    : server(std::move(server)), toServerFaults(seed), toClientFaults(seed + kToClientSeedOffset) {
-    if (!this->server) throw std::invalid_argument("LoopbackTransport needs a SyncServer");
+LoopbackTransport::LoopbackTransport(std::shared_ptr<SyncServer> theServer, uint64_t seed)
+    : server(std::move(theServer)), toServerFaults(seed), toClientFaults(seed + kToClientSeedOffset) {
+    if (!server) throw std::invalid_argument("LoopbackTransport needs a SyncServer");
     deliveryThread = std::thread([this] { run(); });
 }
 
 LoopbackTransport::~LoopbackTransport() {
     if (onDeliveryThread()) {
-        lumivale::assertInternal("Assert (%s:%d): LoopbackTransport destroyed on its own delivery thread",
-                                 "LoopbackTransport", __LINE__);
+        LV_ASSERT_FAIL("LoopbackTransport", "LoopbackTransport destroyed on its own delivery thread");
     }
     disconnect();
     {

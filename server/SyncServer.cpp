@@ -32,8 +32,8 @@ void requireValidCollectionName(const std::string& collectionName) {
 
 SyncServer::SyncServer() : SyncServer(std::make_unique<MemoryLogStorage>()) {}
 
-SyncServer::SyncServer(std::unique_ptr<LogStorage> storage) : storage(std::move(storage)) {
-    if (!this->storage) throw std::invalid_argument("SyncServer needs a storage");
+SyncServer::SyncServer(std::unique_ptr<LogStorage> theStorage) : storage(std::move(theStorage)) {
+    if (!storage) throw std::invalid_argument("SyncServer needs a storage");
 }
 
 SyncServer::SessionId SyncServer::attach(Delivery delivery) {
