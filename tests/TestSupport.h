@@ -10,6 +10,8 @@
 #include <string>
 #include <vector>
 
+#include <sys/types.h>
+
 #include "platform/Log.h"
 
 namespace testsupport {
@@ -56,5 +58,10 @@ private:
 // test, and returns as soon as the condition holds.
 bool waitUntil(const std::function<bool()>& condition,
                std::chrono::milliseconds deadline = std::chrono::seconds(20));
+
+// True while the thread of this process with the kernel id threadId (gettid)
+// sleeps in the kernel, as one waiting for a mutex that another thread holds
+// does; read from /proc/self/task/<id>/stat.
+bool isThreadAsleep(pid_t threadId);
 
 }  // namespace testsupport
