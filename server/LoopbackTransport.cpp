@@ -13,7 +13,6 @@ namespace server {
 
 namespace {
 
-constexpr const char* kTag = "tessarine_server";
 // The two directions draw from different streams of the one seed.
 constexpr uint64_t kToClientSeedOffset = 0x9E3779B97F4A7C15ull;
 
@@ -191,7 +190,7 @@ void LoopbackTransport::run() {
 
 void LoopbackTransport::handle(Message& message, SyncServer::SessionId currentSession) {
     if (message.lost) {
-        lv_printLog(3, kTag, "LoopbackTransport: a message was lost, the link goes down");
+        lv_printLog(LogPriority::kDebug, kServerLogTag, "LoopbackTransport: a message was lost, the link goes down");
         breakLink(message.connection);
         return;
     }
@@ -210,7 +209,7 @@ void LoopbackTransport::handle(Message& message, SyncServer::SessionId currentSe
                 return;
         }
     } catch (const std::exception& e) {
-        lv_printLog(5, kTag, "LoopbackTransport: delivery failed: %s", e.what());
+        lv_printLog(LogPriority::kWarn, kServerLogTag, "LoopbackTransport: delivery failed: %s", e.what());
     }
 }
 
@@ -243,7 +242,7 @@ void LoopbackTransport::reportConnection(uint64_t reportedConnection) {
     try {
         onConnectionEstablished();
     } catch (const std::exception& e) {
-        lv_printLog(5, kTag, "LoopbackTransport: connection callback failed: %s", e.what());
+        lv_printLog(LogPriority::kWarn, kServerLogTag, "LoopbackTransport: connection callback failed: %s", e.what());
     }
     {
         std::lock_guard<std::mutex> lock(mutex);

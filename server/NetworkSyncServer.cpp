@@ -15,10 +15,6 @@ namespace lumivale {
 namespace tessarine {
 namespace server {
 
-namespace {
-constexpr const char* kTag = "tessarine_server";
-}  // namespace
-
 NetworkSyncServer::NetworkSyncServer(const Options& options)
     : server(std::make_unique<SqliteLogStorage>(options.dataPath)),
       discarding(server.attach([](std::vector<unsigned char>) {})),
@@ -54,7 +50,7 @@ void NetworkSyncServer::handleMessage(const std::string& topic, const std::vecto
     bool transient = false;
     SyncServer::SessionId session = sessionFor(topic, payload, transient);
     if (session == 0) {
-        lv_printLog(3, kTag,
+        lv_printLog(LogPriority::kDebug, kServerLogTag,
                     "tessarine-server: dropped a change from a client without a session; it resends after subscribing");
         return;
     }

@@ -69,6 +69,9 @@ namespace lumivale {
 namespace tessarine {
 namespace server {
 
+// The tag of every line the server side (server, transports, program) logs.
+inline constexpr char kServerLogTag[] = "tessarine_server";
+
 class SyncServer {
 public:
     // Takes one ServerPayload buffer for the session's client.
