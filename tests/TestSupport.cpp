@@ -46,6 +46,11 @@ std::vector<LogLine> LogCapture::linesStartingWith(const std::string& prefix) co
     return result;
 }
 
+std::string fileContent(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
 bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds deadline) {
     auto end = std::chrono::steady_clock::now() + deadline;
     while (!condition()) {

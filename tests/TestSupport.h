@@ -53,6 +53,9 @@ private:
     std::vector<LogLine> captured;
 };
 
+// The whole content of a file; empty when it cannot be read.
+std::string fileContent(const std::string& path);
+
 // Waits until condition() holds or the deadline passes; returns the last
 // value of condition(). Polls, so it needs no cooperation from the code under
 // test, and returns as soon as the condition holds.
