@@ -3,16 +3,13 @@
 #include <algorithm>
 
 #include "platform/Log.h"
+#include "server/ServerLog.h"
 
 namespace lumivale {
 namespace tessarine {
 namespace server {
 
 namespace {
-
-constexpr const char* kTag = "tessarine_server";
-constexpr int kWarningPriority = 5;
-constexpr int kInfoPriority = 4;
 
 // A PostgreSQL text[] literal: {"a","b"}, quotes and backslashes escaped.
 std::string arrayLiteral(const std::vector<std::string>& values) {
@@ -114,7 +111,7 @@ void CollectionLeases::round() {
         if (std::optional<std::string> surplus = surplusOf(liveInstances)) handOver(*surplus);
     } catch (const PgError& e) {
         if (!failing) {
-            lv_printLog(kWarningPriority, kTag,
+            lv_printLog(LogPriority::kWarn, kServerLogTag,
                         "CollectionLeases: %s cannot renew its leases (%s); they lapse until the database is back",
                         instanceId.c_str(), e.what());
         }
@@ -123,7 +120,9 @@ void CollectionLeases::round() {
         for (auto& entry : waitingRounds) entry.second = std::max(entry.second, 1);
         return;
     }
-    if (failing) lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s renews its leases again", instanceId.c_str());
+    if (failing)
+        lv_printLog(LogPriority::kInfo, kServerLogTag, "CollectionLeases: %s renews its leases again",
+                    instanceId.c_str());
     failing = false;
     if (handlers.afterRound) handlers.afterRound(acquired);
 }
@@ -140,7 +139,8 @@ int64_t CollectionLeases::renew(std::set<std::string>& renewed) {
         " WHERE holder = $1 AND expires_at > now() RETURNING collection",
         {instanceId, durationMs}));
     connection.exec(
-        "INSERT INTO tessarine_instances (instance, expires_at) VALUES ($1, now() + $2::bigint * interval '1 millisecond')"
+        "INSERT INTO tessarine_instances (instance, expires_at)"
+        " VALUES ($1, now() + $2::bigint * interval '1 millisecond')"
         " ON CONFLICT (instance) DO UPDATE SET expires_at = EXCLUDED.expires_at",
         {instanceId, durationMs});
     int64_t live = connection.exec("SELECT COUNT(*) FROM tessarine_instances WHERE expires_at > now()").integer(0, 0);
@@ -224,8 +224,9 @@ std::optional<std::string> CollectionLeases::surplusOf(int64_t liveInstances) {
 }
 
 void CollectionLeases::handOver(const std::string& collection) {
-    lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s hands \"%s\" over: it serves more than its share",
-                instanceId.c_str(), collection.c_str());
+    lv_printLog(LogPriority::kInfo, kServerLogTag,
+                "CollectionLeases: %s hands \"%s\" over: it serves more than its share", instanceId.c_str(),
+                collection.c_str());
     connection.exec("UPDATE tessarine_leases SET expires_at = now() WHERE collection = $1 AND holder = $2",
                     {collection, instanceId});
 }
@@ -239,8 +240,8 @@ bool CollectionLeases::settle(const std::set<std::string>& nowHeld, std::chrono:
     for (auto entry = held.begin(); entry != held.end();) {
         bool keep = nowHeld.count(entry->first) != 0 && roundStart < entry->second.validUntil;
         if (!keep) {
-            lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s no longer serves \"%s\"", instanceId.c_str(),
-                        entry->first.c_str());
+            lv_printLog(LogPriority::kInfo, kServerLogTag, "CollectionLeases: %s no longer serves \"%s\"",
+                        instanceId.c_str(), entry->first.c_str());
             waitingRounds.emplace(entry->first, kMaxWaitRounds);
         }
         entry = keep ? std::next(entry) : held.erase(entry);
@@ -252,7 +253,8 @@ bool CollectionLeases::settle(const std::set<std::string>& nowHeld, std::chrono:
         entry->second.epoch = ++lastEpoch;
         waitingRounds.erase(name);
         acquired = true;
-        lv_printLog(kInfoPriority, kTag, "CollectionLeases: %s serves \"%s\"", instanceId.c_str(), name.c_str());
+        lv_printLog(LogPriority::kInfo, kServerLogTag, "CollectionLeases: %s serves \"%s\"", instanceId.c_str(),
+                    name.c_str());
     }
     return acquired;
 }
@@ -262,7 +264,7 @@ void CollectionLeases::release() {
         connection.exec("UPDATE tessarine_leases SET expires_at = now() WHERE holder = $1", {instanceId});
         connection.exec("DELETE FROM tessarine_instances WHERE instance = $1", {instanceId});
     } catch (const PgError& e) {
-        lv_printLog(kWarningPriority, kTag, "CollectionLeases: %s could not end its leases (%s); they lapse",
+        lv_printLog(LogPriority::kWarn, kServerLogTag, "CollectionLeases: %s could not end its leases (%s); they lapse",
                     instanceId.c_str(), e.what());
     }
 }

@@ -13,22 +13,20 @@ namespace server {
 
 namespace {
 
-constexpr const char* kTag = "tessarine_server";
 // The two directions draw from different streams of the one seed.
 constexpr uint64_t kToClientSeedOffset = 0x9E3779B97F4A7C15ull;
 
 }  // namespace
 
-LoopbackTransport::LoopbackTransport(std::shared_ptr<SyncServer> server, uint64_t seed)
-    : server(std::move(server)), toServerFaults(seed), toClientFaults(seed + kToClientSeedOffset) {
-    if (!this->server) throw std::invalid_argument("LoopbackTransport needs a SyncServer");
+LoopbackTransport::LoopbackTransport(std::shared_ptr<SyncServer> theServer, uint64_t seed)
+    : server(std::move(theServer)), toServerFaults(seed), toClientFaults(seed + kToClientSeedOffset) {
+    if (!server) throw std::invalid_argument("LoopbackTransport needs a SyncServer");
     deliveryThread = std::thread([this] { run(); });
 }
 
 LoopbackTransport::~LoopbackTransport() {
     if (onDeliveryThread()) {
-        lumivale::assertInternal("Assert (%s:%d): LoopbackTransport destroyed on its own delivery thread",
-                                 "LoopbackTransport", __LINE__);
+        LV_ASSERT_FAIL("LoopbackTransport", "LoopbackTransport destroyed on its own delivery thread");
     }
     disconnect();
     {
@@ -192,7 +190,7 @@ void LoopbackTransport::run() {
 
 void LoopbackTransport::handle(Message& message, SyncServer::SessionId currentSession) {
     if (message.lost) {
-        lv_printLog(3, kTag, "LoopbackTransport: a message was lost, the link goes down");
+        lv_printLog(LogPriority::kDebug, kServerLogTag, "LoopbackTransport: a message was lost, the link goes down");
         breakLink(message.connection);
         return;
     }
@@ -211,7 +209,7 @@ void LoopbackTransport::handle(Message& message, SyncServer::SessionId currentSe
                 return;
         }
     } catch (const std::exception& e) {
-        lv_printLog(5, kTag, "LoopbackTransport: delivery failed: %s", e.what());
+        lv_printLog(LogPriority::kWarn, kServerLogTag, "LoopbackTransport: delivery failed: %s", e.what());
     }
 }
 
@@ -244,7 +242,7 @@ void LoopbackTransport::reportConnection(uint64_t reportedConnection) {
     try {
         onConnectionEstablished();
     } catch (const std::exception& e) {
-        lv_printLog(5, kTag, "LoopbackTransport: connection callback failed: %s", e.what());
+        lv_printLog(LogPriority::kWarn, kServerLogTag, "LoopbackTransport: connection callback failed: %s", e.what());
     }
     {
         std::lock_guard<std::mutex> lock(mutex);

@@ -18,7 +18,6 @@ namespace server {
 
 namespace {
 
-constexpr const char* kTag = "tessarine_server";
 constexpr size_t kHostNameBytes = 256;
 
 // The instance's name in the leases: as given, or the host and process.
@@ -114,7 +113,7 @@ void NetworkSyncServer::handleMessage(const std::string& topic, const std::vecto
     bool transient = false;
     SyncServer::SessionId session = key ? sessionFor(topic, *key, transient) : discarding;
     if (session == 0) {
-        lv_printLog(3, kTag,
+        lv_printLog(LogPriority::kDebug, kServerLogTag,
                     "tessarine-server: dropped a change from a client without a session; it resends after subscribing");
         return;
     }

@@ -5,6 +5,7 @@
 #include <algorithm>
 
 #include "platform/Log.h"
+#include "server/ServerLog.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -12,9 +13,6 @@ namespace server {
 
 namespace {
 
-constexpr const char* kTag = "tessarine_server";
-constexpr int kWarningPriority = 5;
-constexpr int kInfoPriority = 4;
 constexpr int kTextFormat = 0;
 constexpr int kBinaryFormat = 1;
 
@@ -90,13 +88,13 @@ void PgConnection::connect() {
     // exists, say) are not news.
     PQsetNoticeProcessor(connection, [](void*, const char*) {}, nullptr);
     retryDelay = kMinRetryDelay;
-    if (inOutage) lv_printLog(kInfoPriority, kTag, "PgConnection: connected to the database again");
+    if (inOutage) lv_printLog(LogPriority::kInfo, kServerLogTag, "PgConnection: connected to the database again");
     inOutage = false;
 }
 
 void PgConnection::lost(const std::string& why) {
     if (!inOutage) {
-        lv_printLog(kWarningPriority, kTag, "PgConnection: lost the database (%s); retrying", why.c_str());
+        lv_printLog(LogPriority::kWarn, kServerLogTag, "PgConnection: lost the database (%s); retrying", why.c_str());
     }
     inOutage = true;
     nextAttempt = std::chrono::steady_clock::now() + retryDelay;

@@ -1,6 +1,7 @@
 #include "server/PostgresLogStorage.h"
 
 #include "platform/Log.h"
+#include "server/ServerLog.h"
 #include "server/PostgresSchema.h"
 
 namespace lumivale {
@@ -9,8 +10,6 @@ namespace server {
 
 namespace {
 
-constexpr const char* kTag = "tessarine_server";
-constexpr int kWarningPriority = 5;
 constexpr const char* kSelectChanges =
     "SELECT client_id, collection, version_id, primary_key, sort_key, type, blob, sequence FROM tessarine_changes ";
 constexpr const char* kSelectObjects =
@@ -60,8 +59,8 @@ PostgresLogStorage::PostgresLogStorage(const std::string& conninfo, std::string 
     try {
         ensureSchema();
     } catch (const PgError& e) {
-        lv_printLog(kWarningPriority, kTag, "PostgresLogStorage: cannot create the tables yet (%s); retrying",
-                    e.what());
+        lv_printLog(LogPriority::kWarn, kServerLogTag,
+                    "PostgresLogStorage: cannot create the tables yet (%s); retrying", e.what());
     }
 }
 

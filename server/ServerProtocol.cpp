@@ -3,7 +3,7 @@
 #include <stdexcept>
 
 #include "tessarine/Protocol.h"
-#include "tessarine/schema/tessarine_generated.h"
+#include "tessarine/WireFormat.h"
 
 namespace wire = ::tessarine::wire;
 
@@ -13,28 +13,11 @@ namespace server {
 
 namespace {
 
-// The same limits the store's readers verify with.
-constexpr flatbuffers::uoffset_t kMaxDepth = 64;
-constexpr flatbuffers::uoffset_t kMaxTables = 1000000;
-constexpr size_t kInitialBuilderSize = 1024;
-
-template <typename Root>
-const Root* verifiedRoot(const std::vector<unsigned char>& bytes) {
-    if (bytes.size() >= FLATBUFFERS_MAX_BUFFER_SIZE) return nullptr;
-    flatbuffers::Verifier verifier(bytes.data(), bytes.size(), kMaxDepth, kMaxTables);
-    if (!verifier.VerifyBuffer<Root>(nullptr)) return nullptr;
-    return flatbuffers::GetRoot<Root>(bytes.data());
-}
-
-// Present and non-empty once read as zero-terminated text.
-bool hasText(const flatbuffers::String* text) { return text != nullptr && text->c_str()[0] != '\0'; }
-
-std::string readText(const flatbuffers::String* text) { return text == nullptr ? std::string() : text->c_str(); }
-
-std::vector<unsigned char> finishedBytes(flatbuffers::FlatBufferBuilder& builder) {
-    const uint8_t* start = builder.GetBufferPointer();
-    return std::vector<unsigned char>(start, start + builder.GetSize());
-}
+using wireformat::finishedBytes;
+using wireformat::hasText;
+using wireformat::kInitialBuilderSize;
+using wireformat::readText;
+using wireformat::verifiedRoot;
 
 // Wraps an inner buffer (a ServerDeltaList or a Snapshot) in its envelope.
 std::vector<unsigned char> envelope(wire::PayloadType type, const std::vector<unsigned char>& inner) {

@@ -1,7 +1,5 @@
 #include "server/SqliteLogStorage.h"
 
-#include <sqlite3.h>
-
 namespace lumivale {
 namespace tessarine {
 namespace server {
@@ -12,7 +10,7 @@ constexpr const char* kChangeColumns =
     "client_id, collection, version_id, primary_key, sort_key, type, blob, sequence";
 
 std::unique_ptr<sqlite::Database> openDatabase(const std::string& path) {
-    auto database = std::make_unique<sqlite::Database>(path, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE);
+    auto database = std::make_unique<sqlite::Database>(path, sqlite::kOpenReadWriteCreate);
     // First, so that opening waits for readers of the file (and the recovery
     // after a crash) instead of failing.
     database->exec("PRAGMA busy_timeout = 5000");
@@ -64,12 +62,12 @@ SyncProtocol::Delta SqliteLogStorage::readChange(sqlite::Statement& statement) {
     SyncProtocol::Delta change;
     change.clientId = statement(0).getText();
     change.collectionName = statement(1).getText();
-    change.versionId = static_cast<uint64_t>(statement(2).getInt64());
+    change.versionId = statement(2).getUint64();
     change.primaryKey = statement(3).getText();
     change.sortKey = statement(4).getText();
     change.type = static_cast<SyncProtocol::DeltaType>(statement(5).getInt());
     change.blob = readBlob(statement, 6);
-    change.sequenceNumber = static_cast<uint64_t>(statement(7).getInt64());
+    change.sequenceNumber = statement(7).getUint64();
     return change;
 }
 
@@ -77,7 +75,7 @@ std::optional<SyncProtocol::Delta> SqliteLogStorage::findAccepted(const SyncProt
     selectAccepted.reset();
     selectAccepted.bind(1, change.collectionName);
     selectAccepted.bind(2, change.clientId);
-    selectAccepted.bind(3, static_cast<long long>(change.versionId));
+    selectAccepted.bind(3, change.versionId);
     if (!selectAccepted.step()) return std::nullopt;
     return readChange(selectAccepted);
 }
@@ -90,12 +88,12 @@ std::optional<SyncProtocol::Delta> SqliteLogStorage::append(const SyncProtocol::
             insertChange.reset();
             insertChange.bind(1, change.clientId);
             insertChange.bind(2, change.collectionName);
-            insertChange.bind(3, static_cast<long long>(change.versionId));
+            insertChange.bind(3, change.versionId);
             insertChange.bind(4, change.primaryKey);
             insertChange.bind(5, change.sortKey);
             insertChange.bind(6, static_cast<int>(change.type));
             bindBlob(insertChange, 7, change.blob);
-            insertChange.bind(8, static_cast<long long>(logged.sequenceNumber));
+            insertChange.bind(8, logged.sequenceNumber);
             insertChange.step();
             sqlite::Statement& apply = change.type == SyncProtocol::DeltaType::DELETE ? deleteObject : saveObject;
             apply.reset();
@@ -115,7 +113,7 @@ std::vector<SyncProtocol::Delta> SqliteLogStorage::changesAfter(const std::strin
                                                                 uint64_t sequenceNumber) {
     selectChangesAfter.reset();
     selectChangesAfter.bind(1, collectionName);
-    selectChangesAfter.bind(2, static_cast<long long>(sequenceNumber));
+    selectChangesAfter.bind(2, sequenceNumber);
     std::vector<SyncProtocol::Delta> changes;
     while (selectChangesAfter.step()) changes.push_back(readChange(selectChangesAfter));
     return changes;
@@ -125,7 +123,7 @@ uint64_t SqliteLogStorage::lastSequenceNumber(const std::string& collectionName)
     selectLastSequence.reset();
     selectLastSequence.bind(1, collectionName);
     selectLastSequence.step();
-    return static_cast<uint64_t>(selectLastSequence(0).getInt64());
+    return selectLastSequence(0).getUint64();
 }
 
 std::optional<uint64_t> SqliteLogStorage::highestVersionId(const std::string& collectionName,
@@ -134,7 +132,7 @@ std::optional<uint64_t> SqliteLogStorage::highestVersionId(const std::string& co
     selectHighestVersion.bind(1, collectionName);
     selectHighestVersion.bind(2, clientId);
     if (!selectHighestVersion.step()) return std::nullopt;
-    return static_cast<uint64_t>(selectHighestVersion(0).getInt64());
+    return selectHighestVersion(0).getUint64();
 }
 
 std::vector<SyncProtocol::TessarineObject> SqliteLogStorage::objects(const std::string& collectionName) {

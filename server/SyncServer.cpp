@@ -17,9 +17,6 @@ namespace server {
 
 namespace {
 
-constexpr const char* kTag = "tessarine_server";
-constexpr int kWarningPriority = 5;
-
 // Collection names become part of table names in every store, so a name the
 // store would refuse is refused here before it reaches anyone.
 void requireValidCollectionName(const std::string& collectionName) {
@@ -32,8 +29,8 @@ void requireValidCollectionName(const std::string& collectionName) {
 
 SyncServer::SyncServer() : SyncServer(std::make_unique<MemoryLogStorage>()) {}
 
-SyncServer::SyncServer(std::unique_ptr<LogStorage> storage) : storage(std::move(storage)) {
-    if (!this->storage) throw std::invalid_argument("SyncServer needs a storage");
+SyncServer::SyncServer(std::unique_ptr<LogStorage> theStorage) : storage(std::move(theStorage)) {
+    if (!storage) throw std::invalid_argument("SyncServer needs a storage");
 }
 
 SyncServer::SessionId SyncServer::attach(Delivery delivery) {
@@ -67,7 +64,7 @@ SyncServer::Receipt SyncServer::receive(SessionId sessionId, const std::string& 
         if (topic == protocol::TOPIC_SNAPSHOT) return receiveSnapshotRequest(found->second, payload);
         throw std::runtime_error("unknown topic");
     } catch (const std::exception& e) {
-        lv_printLog(kWarningPriority, kTag, "SyncServer: dropped a payload of %zu bytes on \"%s\" from session %llu: %s",
+        lv_printLog(LogPriority::kWarn, kServerLogTag, "SyncServer: dropped a payload of %zu bytes on \"%s\" from session %llu: %s",
                     payload.size(), topic.c_str(), static_cast<unsigned long long>(sessionId), e.what());
         return Receipt{};
     }
@@ -98,7 +95,7 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
             sendChanges(entry.second, {logged}, logged.sequenceNumber);
         }
     }
-    lv_printLog(3, kTag, "SyncServer: session %llu: %s/%s version %llu accepted as %llu",
+    lv_printLog(LogPriority::kDebug, kServerLogTag, "SyncServer: session %llu: %s/%s version %llu accepted as %llu",
                 static_cast<unsigned long long>(sessionId), change.collectionName.c_str(), change.primaryKey.c_str(),
                 static_cast<unsigned long long>(change.versionId),
                 static_cast<unsigned long long>(logged.sequenceNumber));

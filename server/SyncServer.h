@@ -63,6 +63,7 @@
 #include <memory>
 
 #include "server/LogStorage.h"
+#include "server/ServerLog.h"
 #include "tessarine/SyncProtocol.h"
 
 namespace lumivale {

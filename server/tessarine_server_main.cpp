@@ -15,9 +15,9 @@
 
 namespace {
 
+using lumivale::tessarine::server::kServerLogTag;
 using lumivale::tessarine::server::NetworkSyncServer;
 
-constexpr int kInfoPriority = 4;
 
 void usage(const char* program) {
     std::printf(
@@ -105,7 +105,7 @@ int main(int argc, char** argv) {
     }
     if (!verbose) {
         lumivale::setLogSink([](int priority, const std::string& tag, const std::string& message) {
-            if (priority >= kInfoPriority) std::fprintf(stderr, "%s: %s\n", tag.c_str(), message.c_str());
+            if (priority >= lumivale::LogPriority::kInfo) std::fprintf(stderr, "%s: %s\n", tag.c_str(), message.c_str());
         });
     }
     // Blocked before any thread starts, so that only sigwait below takes them.
@@ -117,12 +117,12 @@ int main(int argc, char** argv) {
     try {
         NetworkSyncServer server(options);
         server.start();
-        lv_printLog(kInfoPriority, "tessarine_server", "tessarine-server: serving %s through %s:%d",
+        lv_printLog(lumivale::LogPriority::kInfo, kServerLogTag, "tessarine-server: serving %s through %s:%d",
                     options.postgres.empty() ? options.dataPath.c_str() : "PostgreSQL", options.broker.host.c_str(),
                     options.broker.port);
         int signal = 0;
         sigwait(&stopSignals, &signal);
-        lv_printLog(kInfoPriority, "tessarine_server", "tessarine-server: stopping on signal %d", signal);
+        lv_printLog(lumivale::LogPriority::kInfo, kServerLogTag, "tessarine-server: stopping on signal %d", signal);
     } catch (const std::exception& e) {
         std::fprintf(stderr, "%s: %s\n", argv[0], e.what());
         return 1;

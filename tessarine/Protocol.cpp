@@ -3,7 +3,7 @@
 #include <stdexcept>
 
 #include "platform/Log.h"
-#include "tessarine/schema/tessarine_generated.h"
+#include "tessarine/WireFormat.h"
 
 namespace wire = ::tessarine::wire;
 
@@ -13,10 +13,13 @@ namespace protocol {
 
 namespace {
 
+using wireformat::finishedBytes;
+using wireformat::kInitialBuilderSize;
+using wireformat::readBytes;
+using wireformat::readText;
+using wireformat::verifiedRoot;
+
 constexpr const char* kTag = "tessarine";
-constexpr flatbuffers::uoffset_t kMaxDepth = 64;
-constexpr flatbuffers::uoffset_t kMaxTables = 1000000;
-constexpr size_t kInitialBuilderSize = 1024;
 
 [[noreturn]] void rejectBuffer(const char* logLine, const char* message) {
     lv_printLog(LogPriority::kError, kTag, "%s", logLine);
@@ -29,28 +32,6 @@ constexpr size_t kInitialBuilderSize = 1024;
 
 [[noreturn]] void rejectSnapshot() {
     rejectBuffer("Error deserializing Snapshot: invalid", "Invalid Snapshot flatbuffer.");
-}
-
-// Verifies a whole buffer whose root table is Root. The data must start at
-// an address aligned for the buffer's widest scalar (8 bytes), as heap
-// memory is: the verifier checks alignment relative to the buffer's start
-// only, and the tables are then read in place.
-template <typename Root>
-bool isValidBuffer(const unsigned char* data, size_t size) {
-    // The verifier refuses (by assertion) to look at anything this large.
-    if (size >= FLATBUFFERS_MAX_BUFFER_SIZE) return false;
-    flatbuffers::Verifier verifier(data, size, kMaxDepth, kMaxTables);
-    return verifier.VerifyBuffer<Root>(nullptr);
-}
-
-// Strings travel as counted bytes but are read as C text: the copy ends at
-// the first zero byte. An absent string reads as empty.
-std::string readText(const flatbuffers::String* text) {
-    return text == nullptr ? std::string() : std::string(text->c_str());
-}
-
-std::vector<unsigned char> readBytes(const flatbuffers::Vector<uint8_t>* bytes) {
-    return bytes == nullptr ? std::vector<unsigned char>() : std::vector<unsigned char>(bytes->begin(), bytes->end());
 }
 
 uint64_t versionOf(const wire::ServerDelta& serverDelta) {
@@ -68,11 +49,6 @@ SyncProtocol::TessarineObject makeTessarineObject(const wire::TessarineObject& o
     result.sortKey = readText(object.sortKey());
     result.blob = readBytes(object.blob());
     return result;
-}
-
-std::vector<unsigned char> finishedBytes(flatbuffers::FlatBufferBuilder& builder) {
-    const uint8_t* start = builder.GetBufferPointer();
-    return std::vector<unsigned char>(start, start + builder.GetSize());
 }
 
 }  // namespace
@@ -128,15 +104,16 @@ SyncProtocol::Delta makeTessarineDelta(const std::string& buffer, uint64_t seque
 }
 
 SyncProtocol::Delta makeTessarineDelta(const std::vector<unsigned char>& buffer, uint64_t sequenceNumber) {
-    if (!isValidBuffer<wire::ServerDelta>(buffer.data(), buffer.size())) rejectServerDelta();
-    return makeTessarineDelta(*flatbuffers::GetRoot<wire::ServerDelta>(buffer.data()), sequenceNumber);
+    const auto* serverDelta = verifiedRoot<wire::ServerDelta>(buffer);
+    if (serverDelta == nullptr) rejectServerDelta();
+    return makeTessarineDelta(*serverDelta, sequenceNumber);
 }
 
 SyncProtocol::ServerPayload deserializeServerPayload(std::vector<unsigned char> bytes) {
     const char* logLine = "Error deserializing ServerPayload: invalid";
     const char* message = "Invalid ServerPayload flatbuffer.";
-    if (!isValidBuffer<wire::ServerPayload>(bytes.data(), bytes.size())) rejectBuffer(logLine, message);
-    const auto* payload = flatbuffers::GetRoot<wire::ServerPayload>(bytes.data());
+    const auto* payload = verifiedRoot<wire::ServerPayload>(bytes);
+    if (payload == nullptr) rejectBuffer(logLine, message);
     SyncProtocol::ServerPayload result;
     result.type = convertPayloadType(payload->type());
     if (payload->data() == nullptr) rejectBuffer(logLine, message);
@@ -145,10 +122,10 @@ SyncProtocol::ServerPayload deserializeServerPayload(std::vector<unsigned char> 
 }
 
 std::vector<SyncProtocol::Delta> deserializeDeltaList(const std::vector<unsigned char>& bytes) {
-    if (!isValidBuffer<wire::ServerDeltaList>(bytes.data(), bytes.size())) {
+    const auto* list = verifiedRoot<wire::ServerDeltaList>(bytes);
+    if (list == nullptr) {
         rejectBuffer("Error deserializing ServerDeltaList: invalid", "Invalid ServerDeltaList flatbuffer.");
     }
-    const auto* list = flatbuffers::GetRoot<wire::ServerDeltaList>(bytes.data());
     std::vector<SyncProtocol::Delta> deltas;
     if (list->deltas() == nullptr) return deltas;
     deltas.reserve(list->deltas()->size());
@@ -164,9 +141,8 @@ std::vector<SyncProtocol::Delta> deserializeDeltaList(const std::vector<unsigned
 }
 
 SyncProtocol::Snapshot deserializeSnapshot(const std::vector<unsigned char>& bytes) {
-    if (!isValidBuffer<wire::Snapshot>(bytes.data(), bytes.size())) rejectSnapshot();
-    const auto* snapshot = flatbuffers::GetRoot<wire::Snapshot>(bytes.data());
-    if (snapshot->collectionName() == nullptr) rejectSnapshot();
+    const auto* snapshot = verifiedRoot<wire::Snapshot>(bytes);
+    if (snapshot == nullptr || snapshot->collectionName() == nullptr) rejectSnapshot();
     SyncProtocol::Snapshot result;
     result.collectionName = readText(snapshot->collectionName());
     result.sequenceNumber = snapshot->sequenceNumber();

@@ -12,11 +12,8 @@
 #include "sqlite/SQLiteException.h"
 #include "tessarine/CallbackManager.h"
 #include "tessarine/CollectionIndexStorage.h"
-#include "tessarine/CollectionIndexStorageQueries.h"
 #include "tessarine/CollectionObjectStorage.h"
-#include "tessarine/CollectionObjectStorageQueries.h"
 #include "tessarine/CollectionStorage.h"
-#include "tessarine/CollectionStorageQueries.h"
 #include "tessarine/VersionIdGenerator.h"
 
 using lumivale::sqlite::kOpenReadWriteCreate;
@@ -85,24 +82,6 @@ protected:
         db, callbacks, std::make_shared<CollectionIndexStorage>(db), std::make_shared<CollectionObjectStorage>(db),
         std::make_shared<VersionIdGenerator>(db));
 };
-
-// One builder of each family; the others share their quoting and naming.
-TEST_F(CollectionStorageTest, BuildersWriteExactSqlWithQuotedTableNames) {
-    const std::string table = CollectionObjectStorage(db).getTableName("a:b");
-    const std::string indexTable = CollectionIndexStorage(db).getTableName("a:b");
-    EXPECT_EQ("SELECT primary_key, sort_key, blob, status FROM \"collection_a:b\" "
-              "WHERE sort_key <= ? ORDER BY sort_key DESC LIMIT ?",
-              dbqueries::QueryCollection::getSql(table, false));
-    EXPECT_EQ((Keys{"CREATE INDEX IF NOT EXISTS \"collection_index_a:b_coll_idx_pk_fname_idx\" "
-                    "ON \"collection_index_a:b\" (primary_key, field_name)",
-                    "CREATE INDEX IF NOT EXISTS \"collection_index_a:b_coll_idx_fname_fvalue\" "
-                    "ON \"collection_index_a:b\" (field_name, field_value)"}),
-              dbqueries::CreateCollectionIndexTable::getIndexSqls(indexTable));
-    EXPECT_EQ("SELECT obj.primary_key, obj.sort_key, obj.blob, obj.status FROM \"collection_a:b\" obj "
-              "LEFT OUTER JOIN \"collection_index_a:b\" idx   ON obj.primary_key = idx.primary_key AND "
-              "idx.field_name = ? WHERE obj.primary_key IN (SUB) ORDER BY idx.field_value ASC LIMIT ?",
-              dbqueries::QueryCollectionWithIndexSorted::getSql(table, indexTable, "SUB", "ASC"));
-}
 
 TEST_F(CollectionStorageTest, EnsureTablesIsIdempotentKeepsCounterAndIsAtomic) {
     // A table under the name of x:y's second index makes creating that index fail.

@@ -100,19 +100,4 @@ TEST_F(CollectionTest, WritersOnSeveralThreadsHandChangesOverInVersionIdOrder) {
     EXPECT_EQ("in order", versionOrder(s.transport->sentDeltas()));  // the queue keeps the same order
 }
 
-TEST_F(CollectionTest, IndexedQueriesSeeIndexerFields) {
-    s.store->setCollectionIndexerFunction([](const std::string&, const std::string& key, const std::string&,
-                                             const std::vector<unsigned char>& blob) {
-        return std::unordered_multimap<std::string, std::string>{{"tag", key.substr(0, 1)},
-                                                                 {"size", std::to_string(blob.size())}};
-    });
-    items->saveObject("x1", "a", std::vector<unsigned char>(10));
-    items->saveObject("x2", "b", std::vector<unsigned char>(9));
-    items->saveObject("y1", "c", std::vector<unsigned char>(1));
-    const std::string byTag = "SELECT primary_key FROM {0} WHERE field_name = ? AND field_value = ?";
-    EXPECT_EQ(2u, rows(items->queryWithIndex(byTag, {"tag", "x"}, -1)).size());
-    EXPECT_EQ((std::vector<std::string>{"x1=a:1:10", "x2=b:1:9"}),
-              rows(items->queryWithIndexSorted(byTag, {"tag", "x"}, "size", Direction::ASCENDING, -1)));
-}
-
 }  // namespace

@@ -30,6 +30,7 @@ namespace ts = lumivale::tessarine;
 using Direction = ts::CollectionStorage::SortDirection;
 using testsupport::Journal;
 using testsupport::JournalWrite;
+using testsupport::StoredObject;
 
 #if defined(TESSARINE_TEST_SANITIZED) || defined(TESSARINE_TEST_EMULATED)
 constexpr int kCycles = 30;  // every process runs several times slower
@@ -46,17 +47,6 @@ struct QueuedChange {
     std::vector<unsigned char> blob;
     uint64_t versionId;
 };
-
-struct StoredObject {
-    std::string sortKey;
-    std::vector<unsigned char> blob;
-    int status;
-    bool operator==(const StoredObject& o) const { return sortKey == o.sortKey && blob == o.blob && status == o.status; }
-};
-
-std::ostream& operator<<(std::ostream& out, const StoredObject& o) {
-    return out << "{sort " << o.sortKey << ", " << o.blob.size() << " bytes, status " << o.status << "}";
-}
 
 QueuedChange changeOf(const JournalWrite& write, uint64_t versionId) {
     QueuedChange change{write.collection, write.primaryKey,
@@ -116,15 +106,7 @@ private:
 };
 
 std::map<std::string, StoredObject> readObjects(ts::Collection& collection) {
-    std::map<std::string, StoredObject> result;
-    auto cursor = collection.query("", -1, Direction::ASCENDING);
-    while (cursor && cursor->step()) {
-        auto blob = cursor->getBlob();
-        result[cursor->getPrimaryKey()] = {cursor->getSortKey(),
-                                           std::vector<unsigned char>(blob.first, blob.first + blob.second),
-                                           cursor->getStatus()};
-    }
-    return result;
+    return testsupport::storedObjects(collection.query("", -1, Direction::ASCENDING));
 }
 
 class CrashDurabilityTest : public ::testing::Test {

@@ -1,11 +1,11 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <condition_variable>
-#include <mutex>
 #include <stdexcept>
 #include <thread>
 #include <vector>
+
+#include <unistd.h>
 
 #include "TestSupport.h"
 #include "sqlite/Database.h"
@@ -45,6 +45,21 @@ protected:
         Statement s = db->prepare("SELECT 1 FROM t WHERE k = ?");
         s.bind(1, key);
         return s.step();
+    }
+
+    // Starts another thread that inserts key, and returns once that thread
+    // has finished or has fallen asleep after starting: then it can only be
+    // waiting for the connection's lock.
+    std::thread insertFromOtherThread(const std::string& key, std::atomic<bool>& finished) {
+        std::atomic<pid_t> threadId{0};
+        std::thread other([&, key] {
+            threadId = ::gettid();
+            insert(key);
+            finished = true;
+        });
+        EXPECT_TRUE(testsupport::waitUntil(
+            [&] { return finished || (threadId != 0 && testsupport::isThreadAsleep(threadId)); }));
+        return other;
     }
 
     testsupport::TempDir dir;
@@ -94,33 +109,15 @@ TEST_F(DatabaseTest, NestedTransactionsOnOneThreadCommitTogetherAndInnerFailureU
 // The other thread's insert must neither be rolled back with the transaction
 // nor be visible (committed) while the transaction is still open.
 TEST_F(DatabaseTest, OtherThreadStatementWaitsForTransactionAndSurvivesItsRollback) {
-    std::mutex m;
-    std::condition_variable cv;
-    bool otherReady = false;
     std::atomic<bool> otherDone{false};
     std::thread other;
-
     EXPECT_THROW(db->runInTransaction([&] {
         insert("mine");
-        other = std::thread([&] {
-            {
-                std::lock_guard<std::mutex> lock(m);
-                otherReady = true;
-            }
-            cv.notify_one();
-            insert("theirs");
-            otherDone = true;
-        });
-        std::unique_lock<std::mutex> lock(m);
-        cv.wait(lock, [&] { return otherReady; });
-        lock.unlock();
-        // Give the other thread every chance to run its statement now.
-        for (int i = 0; i < 300; ++i) insert("filler" + std::to_string(i));
-        EXPECT_FALSE(has("theirs"));
+        other = insertFromOtherThread("theirs", otherDone);
         EXPECT_FALSE(otherDone.load());
+        EXPECT_FALSE(has("theirs"));
         throw std::runtime_error("rollback");
     }, kImmediate), std::runtime_error);
-
     other.join();
     EXPECT_TRUE(has("theirs"));
     EXPECT_FALSE(has("mine"));
@@ -131,34 +128,18 @@ TEST_F(DatabaseTest, OtherThreadStatementWaitsForTransactionAndSurvivesItsRollba
 // deadlock here) and keep another thread's statement out until it ends,
 // without making a transaction of the calls it covers.
 TEST_F(DatabaseTest, ScopedLockLetsOwnCallsThroughAndHoldsOthersOff) {
-    std::mutex m;
-    std::condition_variable cv;
-    bool otherReady = false;
     std::atomic<bool> otherDone{false};
     std::thread other;
     {
         Database::ScopedLock lock(*db);
         insert("mine");
-        other = std::thread([&] {
-            {
-                std::lock_guard<std::mutex> guard(m);
-                otherReady = true;
-            }
-            cv.notify_one();
-            insert("theirs");
-            otherDone = true;
-        });
-        std::unique_lock<std::mutex> guard(m);
-        cv.wait(guard, [&] { return otherReady; });
-        guard.unlock();
-        for (int i = 0; i < 300; ++i) insert("filler" + std::to_string(i));
-        EXPECT_FALSE(has("theirs"));
+        other = insertFromOtherThread("theirs", otherDone);
         EXPECT_FALSE(otherDone.load());
+        EXPECT_FALSE(has("theirs"));
     }
     other.join();
     EXPECT_TRUE(has("theirs"));
     EXPECT_TRUE(has("mine"));
-    EXPECT_EQ(302, count());
 }
 
 TEST_F(DatabaseTest, ConcurrentTransactionsAndOpenReadersAcrossThreadsStayConsistent) {

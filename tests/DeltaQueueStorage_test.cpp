@@ -115,23 +115,6 @@ TEST_F(DeltaQueueStorageTest, StatusUpdatesAndRemovalTouchOnlyTheirRow) {
     EXPECT_EQ(2u, storage->getAllDeltas().size());
 }
 
-TEST_F(DeltaQueueStorageTest, SchemaAndIndexNamesAreExact) {
-    auto sqls = lumivale::tessarine::dbqueries::CreateDeltaQueueTable::getIndexSqls("delta_queue");
-    ASSERT_EQ(3u, sqls.size());
-    EXPECT_EQ("CREATE INDEX IF NOT EXISTS \"delta_queue_coll_id_pk_idx\" ON \"delta_queue\" (collection_name, primary_key)",
-              sqls[0]);
-    EXPECT_EQ(
-        "CREATE INDEX IF NOT EXISTS \"delta_queue_coll_id_ver_id_idx\" ON \"delta_queue\" (collection_name, version_id)",
-        sqls[1]);
-    EXPECT_EQ("CREATE INDEX IF NOT EXISTS \"delta_queue_status_idx\" ON \"delta_queue\" (status)", sqls[2]);
-    auto s = db->prepare("SELECT name FROM sqlite_master WHERE tbl_name = 'delta_queue' AND type = 'index' ORDER BY name");
-    std::vector<std::string> names;
-    while (s.step()) names.push_back(s(0).getText());
-    EXPECT_EQ((std::vector<std::string>{"delta_queue_coll_id_pk_idx", "delta_queue_coll_id_ver_id_idx",
-                                        "delta_queue_status_idx"}),
-              names);
-}
-
 TEST(DeltaQueueStorageDeathTest, StoringPersistedIsABrokenInvariant) {
     auto db = std::make_shared<Database>(":memory:", kOpenReadWriteCreate);
     DeltaQueueStorage storage(db);

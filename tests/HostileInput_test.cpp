@@ -15,32 +15,11 @@ namespace ts = lumivale::tessarine;
 using Direction = ts::CollectionStorage::SortDirection;
 using testsupport::LogCapture;
 using testsupport::rows;
+using testsupport::StoredObject;
+using testsupport::storedObjects;
 using testsupport::StoreUnderTest;
 using testsupport::TempDir;
 using Bytes = std::vector<unsigned char>;
-
-struct Object {
-    std::string sortKey;
-    Bytes blob;
-    int status;
-    bool operator==(const Object& o) const { return sortKey == o.sortKey && blob == o.blob && status == o.status; }
-};
-
-std::ostream& operator<<(std::ostream& out, const Object& o) {
-    return out << "{sort " << ::testing::PrintToString(o.sortKey) << ", " << o.blob.size() << " bytes, status "
-               << o.status << "}";
-}
-
-// Every object a cursor yields, by primary key.
-std::map<std::string, Object> objects(std::unique_ptr<ts::Cursor> cursor) {
-    std::map<std::string, Object> result;
-    while (cursor && cursor->step()) {
-        auto blob = cursor->getBlob();
-        result[cursor->getPrimaryKey()] = {cursor->getSortKey(), Bytes(blob.first, blob.first + blob.second),
-                                           cursor->getStatus()};
-    }
-    return result;
-}
 
 Bytes bytesOf(const std::string& text) { return Bytes(text.begin(), text.end()); }
 
@@ -62,7 +41,7 @@ TEST(HostileInputTest, KeysAndBlobsOfAnyBytesRoundTripVerbatimEverywhereAndAcros
         blob.insert(blob.end(), {0, 0xff, '"', '\'', 0});
         return blob;
     };
-    std::map<std::string, Object> expected;
+    std::map<std::string, StoredObject> expected;
     for (size_t i = 0; i < keys.size(); ++i) expected[keys[i]] = {sortKeyOf(i), blobOf(i), 1};
     ts::SyncProtocol::Delta remote;
     remote.clientId = "ANOTHERCLIENT";
@@ -96,12 +75,12 @@ TEST(HostileInputTest, KeysAndBlobsOfAnyBytesRoundTripVerbatimEverywhereAndAcros
             EXPECT_EQ(keys[i], heard[i].primaryKey) << i;
             EXPECT_EQ(blobOf(i), heard[i].blob) << i;
         }
-        EXPECT_EQ(expected, objects(items->query("", -1, Direction::ASCENDING)));
+        EXPECT_EQ(expected, storedObjects(items->query("", -1, Direction::ASCENDING)));
         for (size_t i = 0; i < keys.size(); ++i) {
-            auto one = objects(items->getObject(keys[i]));
+            auto one = storedObjects(items->getObject(keys[i]));
             ASSERT_EQ(1u, one.size()) << i;
             EXPECT_EQ(keys[i], one.begin()->first);
-            auto byIndex = objects(items->queryWithIndex(
+            auto byIndex = storedObjects(items->queryWithIndex(
                 "SELECT primary_key FROM {0} WHERE field_name = 'key' AND field_value = ?", {keys[i]}, -1));
             ASSERT_EQ(1u, byIndex.size()) << i;
             EXPECT_EQ(keys[i], byIndex.begin()->first);
@@ -113,15 +92,15 @@ TEST(HostileInputTest, KeysAndBlobsOfAnyBytesRoundTripVerbatimEverywhereAndAcros
             return heard.size() == keys.size() + 1;
         }));
         expected[remote.primaryKey] = {remote.sortKey, remote.blob, 3};
-        EXPECT_EQ(expected, objects(items->query("", -1, Direction::ASCENDING)));
+        EXPECT_EQ(expected, storedObjects(items->query("", -1, Direction::ASCENDING)));
 
         ASSERT_TRUE(items->deleteObject(std::string("a\0b", 3)));
         expected.erase(std::string("a\0b", 3));
-        EXPECT_EQ(expected, objects(items->query("", -1, Direction::ASCENDING)));
+        EXPECT_EQ(expected, storedObjects(items->query("", -1, Direction::ASCENDING)));
     }
     StoreUnderTest s(path);
     auto items = s.store->subscribeCollection("app:items");
-    EXPECT_EQ(expected, objects(items->query("", -1, Direction::ASCENDING)));
+    EXPECT_EQ(expected, storedObjects(items->query("", -1, Direction::ASCENDING)));
     s.transport->onConnectionEstablished();
     auto resent = s.transport->sentDeltas();
     ASSERT_EQ(keys.size() + 1, resent.size());
@@ -145,16 +124,16 @@ TEST(HostileInputTest, BlobOfTensOfMegabytesIsStoredSentAndResentWhole) {
         ASSERT_TRUE(items->saveObject("big", "s", big));
         EXPECT_EQ(big.size(), heardSize);
         EXPECT_TRUE(big == s.transport->sentDeltas().at(0).blob);
-        EXPECT_TRUE(big == objects(items->getObject("big"))["big"].blob);
+        EXPECT_TRUE(big == storedObjects(items->getObject("big"))["big"].blob);
     }
     StoreUnderTest s(path);
     auto items = s.store->subscribeCollection("app:items");
-    EXPECT_TRUE(big == objects(items->getObject("big"))["big"].blob);
+    EXPECT_TRUE(big == storedObjects(items->getObject("big"))["big"].blob);
     s.transport->onConnectionEstablished();
     ASSERT_EQ(1u, s.transport->sentDeltas().size());
     EXPECT_TRUE(big == s.transport->sentDeltas()[0].blob);
     ASSERT_TRUE(items->saveObject("big", "s", Bytes{1}));
-    EXPECT_EQ(Bytes{1}, objects(items->getObject("big"))["big"].blob);
+    EXPECT_EQ(Bytes{1}, storedObjects(items->getObject("big"))["big"].blob);
 }
 
 TEST(HostileInputTest, IndexSubqueriesThatAreNotOneValidStatementFailAndChangeNothing) {
@@ -166,7 +145,7 @@ TEST(HostileInputTest, IndexSubqueriesThatAreNotOneValidStatementFailAndChangeNo
     auto items = s.store->subscribeCollection("app:items");
     ASSERT_TRUE(items->saveObject("x", "1", Bytes{1}));
     ASSERT_TRUE(items->saveObject("y", "2", Bytes{2}));
-    const auto before = objects(items->query("", -1, Direction::ASCENDING));
+    const auto before = storedObjects(items->query("", -1, Direction::ASCENDING));
 
     LogCapture log;
     // A second statement after the subquery: SQLite would compile the first
@@ -183,10 +162,10 @@ TEST(HostileInputTest, IndexSubqueriesThatAreNotOneValidStatementFailAndChangeNo
     EXPECT_NE(std::string::npos, errors[0].message.find("more than one statement")) << errors[0].message;
 
     // A hostile sort field name is only ever a bound value.
-    EXPECT_EQ(2u, objects(items->queryWithIndexSorted("SELECT primary_key FROM {0}", {}, "tag' OR 1=1; --",
+    EXPECT_EQ(2u, storedObjects(items->queryWithIndexSorted("SELECT primary_key FROM {0}", {}, "tag' OR 1=1; --",
                                                       Direction::ASCENDING, -1)).size());
-    EXPECT_EQ(before, objects(items->query("", -1, Direction::ASCENDING)));
-    EXPECT_EQ(1u, objects(items->queryWithIndex("SELECT primary_key FROM {0} WHERE field_value = ?", {"x"}, -1)).size());
+    EXPECT_EQ(before, storedObjects(items->query("", -1, Direction::ASCENDING)));
+    EXPECT_EQ(1u, storedObjects(items->queryWithIndex("SELECT primary_key FROM {0} WHERE field_value = ?", {"x"}, -1)).size());
     s.transport->onConnectionEstablished();
     EXPECT_EQ(4u, s.transport->sentDeltas().size());  // both writes, sent and resent
 }
@@ -211,9 +190,9 @@ TEST(HostileInputTest, ThrowingCallbacksIndexersAndTransportLeaveStoredDataAsItW
     ASSERT_TRUE(items->saveObject("k", "s", Bytes{1}));
     EXPECT_EQ(1, heardAfterThrowing.load());
     EXPECT_EQ(1u, log.linesStartingWith("Exception in delta callback: callback broke").size());
-    const auto stored = objects(items->query("", -1, Direction::ASCENDING));
+    const auto stored = storedObjects(items->query("", -1, Direction::ASCENDING));
     auto indexed = [&] {
-        return objects(items->queryWithIndex("SELECT primary_key FROM {0} WHERE field_name = 'first' AND field_value = '1'",
+        return storedObjects(items->queryWithIndex("SELECT primary_key FROM {0} WHERE field_name = 'first' AND field_value = '1'",
                                              {}, -1)).size();
     };
     ASSERT_EQ(1u, indexed());
@@ -224,7 +203,7 @@ TEST(HostileInputTest, ThrowingCallbacksIndexersAndTransportLeaveStoredDataAsItW
     EXPECT_FALSE(items->saveObject("k", "t", Bytes{2}));
     indexerThrows = false;
     EXPECT_EQ(1u, log.linesStartingWith("Error while updating object: indexer broke").size());
-    EXPECT_EQ(stored, objects(items->query("", -1, Direction::ASCENDING)));
+    EXPECT_EQ(stored, storedObjects(items->query("", -1, Direction::ASCENDING)));
     EXPECT_EQ(1u, indexed());
     EXPECT_EQ(1, heardAfterThrowing.load());  // failed writes are not reported
 

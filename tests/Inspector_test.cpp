@@ -34,11 +34,6 @@ Outcome inspectWith(const std::vector<std::string>& arguments) {
     return {status, out.str(), err.str()};
 }
 
-std::string fileBytes(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-}
-
 std::vector<unsigned char> bytes(const std::string& text) { return {text.begin(), text.end()}; }
 
 // Two collections with objects in every status and a queue of three changes
@@ -67,7 +62,7 @@ TEST(InspectorTest, ReportsCountsQueueOrderAndObjectsOfAStoreWithoutWritingToIt)
     TempDir dir;
     const std::string path = dir.file("store.db");
     const std::string clientId = buildStore(path);
-    const std::string before = fileBytes(path);
+    const std::string before = testsupport::fileContent(path);
 
     inspect::StoreInspector inspector(path);
     inspect::StoreSummary summary = inspector.summary();
@@ -147,7 +142,7 @@ TEST(InspectorTest, ReportsCountsQueueOrderAndObjectsOfAStoreWithoutWritingToIt)
     EXPECT_NE(std::string::npos, queue.out.find("2. app:tasks version 1  SAVE t  sort key 1  PENDING  3 bytes, hex 0001fe"))
         << queue.out;
     EXPECT_EQ(0, inspectWith({path}).status);
-    EXPECT_EQ(before, fileBytes(path));  // never written
+    EXPECT_EQ(before, testsupport::fileContent(path));  // never written
 }
 
 TEST(InspectorTest, FilesThatCannotBeInspectedGetAClearMessageAndANonZeroExit) {
@@ -184,7 +179,7 @@ TEST(InspectorTest, FilesThatCannotBeInspectedGetAClearMessageAndANonZeroExit) {
     Outcome unknown = inspectWith({store, "objects", "app:none"});
     EXPECT_EQ(1, unknown.status);
     EXPECT_EQ("tessarine-inspect: the store has no collection app:none\n", unknown.err);
-    EXPECT_EQ("this is not a database file, just some text that is long enough", fileBytes(dir.file("text.db")));
+    EXPECT_EQ("this is not a database file, just some text that is long enough", testsupport::fileContent(dir.file("text.db")));
 
     // The installed program exits with the same status.
     testsupport::ChildProcess program(TESSARINE_INSPECT, {dir.file("missing.db")}, TESSARINE_TEST_EMULATOR);

@@ -1,7 +1,11 @@
 // Opening a whole store on a FakeTransport, for the tests of the public API.
 #pragma once
 
+#include <gtest/gtest.h>
+
+#include <map>
 #include <memory>
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -28,6 +32,31 @@ inline std::vector<std::string> rows(std::unique_ptr<lumivale::tessarine::Cursor
     while (cursor && cursor->step()) {
         result.push_back(cursor->getPrimaryKey() + "=" + cursor->getSortKey() + ":" +
                          std::to_string(cursor->getStatus()) + ":" + std::to_string(cursor->getBlob().second));
+    }
+    return result;
+}
+
+// An object as a cursor shows it.
+struct StoredObject {
+    std::string sortKey;
+    std::vector<unsigned char> blob;
+    int status;
+    bool operator==(const StoredObject& o) const { return sortKey == o.sortKey && blob == o.blob && status == o.status; }
+};
+
+inline std::ostream& operator<<(std::ostream& out, const StoredObject& o) {
+    return out << "{sort " << ::testing::PrintToString(o.sortKey) << ", " << o.blob.size() << " bytes, status "
+               << o.status << "}";
+}
+
+// Every object a cursor yields, by primary key.
+inline std::map<std::string, StoredObject> storedObjects(std::unique_ptr<lumivale::tessarine::Cursor> cursor) {
+    std::map<std::string, StoredObject> result;
+    while (cursor && cursor->step()) {
+        auto blob = cursor->getBlob();
+        result[cursor->getPrimaryKey()] = {cursor->getSortKey(),
+                                           std::vector<unsigned char>(blob.first, blob.first + blob.second),
+                                           cursor->getStatus()};
     }
     return result;
 }

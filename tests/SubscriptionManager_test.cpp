@@ -57,16 +57,4 @@ TEST_F(SubscriptionManagerTest, FailingResubscriptionStopsQuietlyAndQueueStillRe
     EXPECT_TRUE(log.linesStartingWith("Error").empty());
 }
 
-TEST_F(SubscriptionManagerTest, DestroyedManagerNoLongerHearsTheTransport) {
-    subscriptionManager->subscribeCollection("a:b");
-    transport->clearSent();
-    tearDownComponents();
-    transport->onConnectionEstablished();
-    transport->onSubscriptionResponseReceived({});
-    transport->onDeltaReceived({remoteSave("a:b", "k", 1)});
-    transport->onDeltaStatusUpdated({});
-    transport->onSnapshotReceived({});
-    EXPECT_TRUE(transport->sentEvents().empty());
-}
-
 }  // namespace

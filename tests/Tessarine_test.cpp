@@ -1,7 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <fstream>
-
 #include "StoreTestSupport.h"
 #include "server/LoopbackTransport.h"
 #include "server/SyncServer.h"
@@ -12,19 +10,6 @@ using lumivale::tessarine::Tessarine;
 using testsupport::LogCapture;
 using testsupport::StoreUnderTest;
 using testsupport::TempDir;
-
-TEST(TessarineTest, OpenFailuresGiveEmptyStoreAndOneLogLine) {
-    TempDir dir;
-    LogCapture log;
-    EXPECT_FALSE(StoreUnderTest(dir.file("missing/store.db")).store);
-    EXPECT_FALSE(Tessarine::open(dir.file("a.db"), nullptr, std::make_shared<testsupport::CountingThreadCreator>()));
-    const std::string notADatabase = dir.file("text.db");
-    std::ofstream(notADatabase) << "this is not a database file, just some text that is long enough";
-    EXPECT_FALSE(StoreUnderTest(notADatabase).store);
-    EXPECT_EQ(3u, log.linesStartingWith("Error while creating tessarine instance: ").size());
-    std::ifstream in(notADatabase);
-    EXPECT_EQ("this", std::string(std::istreambuf_iterator<char>(in), {}).substr(0, 4));  // untouched
-}
 
 TEST(TessarineTest, StartAndInvalidNamesAndIdentityAcrossReopen) {
     TempDir dir;

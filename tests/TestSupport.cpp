@@ -1,6 +1,7 @@
 #include "TestSupport.h"
 
 #include <atomic>
+#include <fstream>
 #include <random>
 #include <thread>
 #include <unistd.h>
@@ -45,6 +46,11 @@ std::vector<LogLine> LogCapture::linesStartingWith(const std::string& prefix) co
     return result;
 }
 
+std::string fileContent(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
 bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds deadline) {
     auto end = std::chrono::steady_clock::now() + deadline;
     while (!condition()) {
@@ -52,6 +58,15 @@ bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds
         std::this_thread::sleep_for(std::chrono::milliseconds(1));
     }
     return true;
+}
+
+bool isThreadAsleep(pid_t threadId) {
+    std::ifstream stat("/proc/self/task/" + std::to_string(threadId) + "/stat");
+    std::string line;
+    std::getline(stat, line);
+    // "tid (name) state ...": the name may hold spaces and parentheses.
+    const size_t nameEnd = line.rfind(')');
+    return nameEnd != std::string::npos && nameEnd + 2 < line.size() && line[nameEnd + 2] == 'S';
 }
 
 }  // namespace testsupport

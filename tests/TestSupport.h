@@ -10,6 +10,8 @@
 #include <string>
 #include <vector>
 
+#include <sys/types.h>
+
 #include "platform/Log.h"
 
 namespace testsupport {
@@ -51,10 +53,18 @@ private:
     std::vector<LogLine> captured;
 };
 
+// The whole content of a file; empty when it cannot be read.
+std::string fileContent(const std::string& path);
+
 // Waits until condition() holds or the deadline passes; returns the last
 // value of condition(). Polls, so it needs no cooperation from the code under
 // test, and returns as soon as the condition holds.
 bool waitUntil(const std::function<bool()>& condition,
                std::chrono::milliseconds deadline = std::chrono::seconds(20));
+
+// True while the thread of this process with the kernel id threadId (gettid)
+// sleeps in the kernel, as one waiting for a mutex that another thread holds
+// does; read from /proc/self/task/<id>/stat.
+bool isThreadAsleep(pid_t threadId);
 
 }  // namespace testsupport

@@ -26,11 +26,6 @@ using testsupport::rows;
 using testsupport::StoreUnderTest;
 using testsupport::TempDir;
 
-std::string contentOf(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-}
-
 std::vector<std::string> filesIn(const fs::path& folder) {
     std::vector<std::string> names;
     for (const auto& entry : fs::directory_iterator(folder)) names.push_back(entry.path().filename().string());
@@ -69,12 +64,16 @@ TEST(UnusableDatabaseTest, FilesThatAreNotDatabasesOrUnreachableAreLeftUntouched
 
     EXPECT_FALSE(StoreUnderTest(fakePath).store);
     EXPECT_FALSE(StoreUnderTest(notAFolder + "/store.db").store);
+    EXPECT_FALSE(StoreUnderTest(dir.file("missing/store.db")).store);
     auto errors = log.linesStartingWith("Error while creating tessarine instance: ");
-    ASSERT_EQ(2u, errors.size());
+    ASSERT_EQ(3u, errors.size());
     EXPECT_NE(std::string::npos, errors[0].message.find("file is not a database")) << errors[0].message;
-    EXPECT_EQ(fake, contentOf(fakePath));
-    EXPECT_EQ("a file", contentOf(notAFolder));
+    EXPECT_EQ(fake, testsupport::fileContent(fakePath));
+    EXPECT_EQ("a file", testsupport::fileContent(notAFolder));
     EXPECT_EQ((std::vector<std::string>{"fake.db", "folder"}), filesIn(dir.path()));  // no -wal, no -shm
+    // A store needs a transport.
+    EXPECT_FALSE(ts::Tessarine::open(dir.file("a.db"), nullptr, std::make_shared<testsupport::CountingThreadCreator>()));
+    EXPECT_EQ(4u, log.linesStartingWith("Error while creating tessarine instance: ").size());
 }
 
 // Runs the probe program on a store whose file and folder have the given
@@ -108,7 +107,7 @@ TEST(UnusableDatabaseTest, ReadOnlyFileOrFolderFailsOpenAndChangesNothing) {
     const std::string path = folder + "/store.db";
     makeStore(path);
     ASSERT_EQ((std::vector<std::string>{"store.db"}), filesIn(folder));  // closed cleanly, log checkpointed
-    const std::string before = contentOf(path);
+    const std::string before = testsupport::fileContent(path);
     const fs::perms readOnly = fs::perms::owner_read | fs::perms::group_read | fs::perms::others_read;
     const fs::perms readWrite = readOnly | fs::perms::owner_write | fs::perms::group_write | fs::perms::others_write;
     const fs::perms folderReadOnly = readOnly | fs::perms::owner_exec | fs::perms::group_exec | fs::perms::others_exec;
@@ -130,7 +129,7 @@ TEST(UnusableDatabaseTest, ReadOnlyFileOrFolderFailsOpenAndChangesNothing) {
         EXPECT_EQ(0u, report[0].find("log 6 Error while creating tessarine instance: ")) << report[0];
         EXPECT_NE(std::string::npos, report[0].find(c.reason)) << report[0];
         EXPECT_EQ("open failed", report[1]);
-        EXPECT_EQ(before, contentOf(path));
+        EXPECT_EQ(before, testsupport::fileContent(path));
         EXPECT_EQ((std::vector<std::string>{"store.db"}), filesIn(folder));
     }
     expectStoreIntact(path);

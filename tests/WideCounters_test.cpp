@@ -13,13 +13,13 @@
 #include "tessarine/VersionIdGenerator.h"
 
 using lumivale::sqlite::Database;
+using lumivale::sqlite::kOpenReadWriteCreate;
 using lumivale::tessarine::SyncProtocol;
 using lumivale::tessarine::VersionIdGenerator;
 namespace protocol = lumivale::tessarine::protocol;
 
 namespace {
 
-constexpr int kOpenReadWriteCreate = 6;
 constexpr uint64_t k32BitsFull = 0xFFFFFFFFull;
 
 TEST(WideCountersTest, VersionIdCounterCountsPast32BitsAndKeepsThatAcrossReopen) {
