@@ -15,10 +15,10 @@
 // (it started first, say) hands one collection over per round, ending its
 // lease for another instance to take. A collection that nobody has served
 // for kMaxWaitRounds rounds in a row is taken by whoever sees it, share or
-// not. Leases
-// are renewed only while mayRenew() (the instance is connected to its
-// broker): an instance cut off from its clients lets its collections go
-// within a lease's duration.
+// not. Leases are renewed only while mayRenew() (the instance is connected
+// to its broker with its subscription granted): an instance cut off from its
+// clients, or deaf to them, lets its collections go within a lease's
+// duration.
 //
 // Locally a lease counts as held until renewPeriod before it expires (its
 // expiry is measured from before the renewal was sent, so the local clock

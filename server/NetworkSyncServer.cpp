@@ -67,7 +67,7 @@ std::unique_ptr<LogStorage> NetworkSyncServer::makeStorage(const Options& option
 std::unique_ptr<CollectionOwnership> NetworkSyncServer::makeLeases(const Options& options) {
     return std::make_unique<CollectionLeases>(
         options.postgres, instanceIdOf(options), options.leaseTimings,
-        CollectionLeases::Handlers{[this] { return connection.isConnected(); },
+        CollectionLeases::Handlers{[this] { return connection.isListening(); },
                                    [this](bool acquired) { afterLeaseRound(acquired); }});
 }
 #else

@@ -19,9 +19,10 @@ constexpr int kQos = 1;
 constexpr int kRefused = 0x80;
 // A refused subscription is asked for again as soon as the refusal comes,
 // up to this many times per connection: a broker that is still electing its
-// leaders (a NATS node that just joined) refuses for seconds, each refusal
-// taking it tens of milliseconds; one that forbids the topic does so forever.
-constexpr int kMaxSubscribeAttempts = 200;
+// leaders (a NATS node that just restarted) refuses for seconds, tens of
+// seconds on a loaded machine, each refusal taking it tens of milliseconds;
+// one that forbids the topic does so forever.
+constexpr int kMaxSubscribeAttempts = 2000;
 
 void initialiseLibrary() {
     static const int once = mosquitto_lib_init();
@@ -162,6 +163,8 @@ int MqttConnection::publish(const std::string& topic, const std::vector<unsigned
 
 bool MqttConnection::isConnected() const { return connected; }
 
+bool MqttConnection::isListening() const { return listening; }
+
 void MqttConnection::onConnect(struct mosquitto* mosq, void* self, int rc) {
     static_cast<MqttConnection*>(self)->handleConnect(mosq, rc);
 }
@@ -169,6 +172,7 @@ void MqttConnection::onConnect(struct mosquitto* mosq, void* self, int rc) {
 void MqttConnection::onDisconnect(struct mosquitto*, void* self, int rc) {
     auto* connection = static_cast<MqttConnection*>(self);
     connection->connected = false;
+    connection->listening = false;
     if (rc != 0) lv_printLog(4, kTag, "%s: connection lost: %s", connection->name.c_str(), mosquitto_strerror(rc));
     if (connection->handlers.disconnected) connection->guard("disconnected", connection->handlers.disconnected);
 }
@@ -193,13 +197,17 @@ void MqttConnection::handleSubscribed(struct mosquitto* mosq, int messageId, int
         awaited.erase(found);
         if (granted == kRefused) {
             attempts = ++refusals[topic];
+            listening = false;
         } else {
             // Granted after a refusal, once the connection was announced:
             // what was published to the topic meanwhile is lost, as when
             // the connection drops, so it is announced again.
             announce = refusals.erase(topic) != 0 && announced;
         }
-        announce = announce || (awaited.empty() && !announced);
+        // Never while a subscription stands refused: its messages are not
+        // coming, and the connected handler would tell the store or the
+        // server otherwise.
+        announce = refusals.empty() && (announce || (awaited.empty() && !announced));
     }
     if (attempts > 0 && attempts < kMaxSubscribeAttempts) {
         if (attempts == 1) {
@@ -234,6 +242,7 @@ void MqttConnection::handleConnect(struct mosquitto* mosq, int rc) {
         awaited.clear();
         refusals.clear();
         announced = false;
+        listening = false;
     }
     // Up before the copy, so that a topic added meanwhile is either in the
     // copy or subscribed by subscribe() itself.
@@ -253,6 +262,7 @@ void MqttConnection::announce() {
     {
         std::lock_guard<std::mutex> lock(subscriptionsMutex);
         announced = true;
+        listening = true;
     }
     if (handlers.connected) guard("connected", handlers.connected);
 }

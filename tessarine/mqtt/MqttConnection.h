@@ -5,11 +5,12 @@
 //
 // Handlers (all optional) run on the connection's network thread, one at a
 // time, never under a lock of this class:
-//   - connected: a connection is up and the broker has answered its
-//     subscriptions (granted, or refused for good), so that what is
-//     published from here on reaches this client; and again when a
-//     subscription the broker refused is granted after all (what was
-//     published to it meanwhile is lost, as when a connection drops);
+//   - connected: a connection is up and the broker has granted every
+//     subscription, so that what is published from here on reaches this
+//     client; and again when a subscription the broker refused is granted
+//     after all (what was published to it meanwhile is lost, as when a
+//     connection drops). A connection that gave up asking for a refused
+//     subscription is never announced;
 //   - message: a message arrived on a subscribed topic (retained: the broker
 //     kept it from before this connection's subscription);
 //   - published: the broker acknowledged the publish with that message id;
@@ -106,6 +107,11 @@ public:
     int publish(const std::string& topic, const std::vector<unsigned char>& payload, bool retain = false);
 
     bool isConnected() const;
+    // Connected with every subscription granted: what the broker delivers to
+    // the subscribed topics reaches the message handler. False from a
+    // refusal until the subscription is granted again, and for good on a
+    // connection that gave up asking.
+    bool isListening() const;
 
     const ConnectionOptions& options() const { return settings; }
 
@@ -140,6 +146,7 @@ private:
     std::shared_mutex clientMutex;
     struct mosquitto* client = nullptr;
     std::atomic<bool> connected{false};
+    std::atomic<bool> listening{false};
     bool started = false;
 
     std::mutex topicsMutex;  // guards topics; taken briefly, never across a handler
