@@ -18,16 +18,6 @@ namespace server {
 
 namespace {
 
-constexpr size_t kHostNameBytes = 256;
-
-// The instance's name in the leases: as given, or the host and process.
-std::string instanceIdOf(const NetworkSyncServer::Options& options) {
-    if (!options.instanceId.empty()) return options.instanceId;
-    char host[kHostNameBytes] = {};
-    ::gethostname(host, sizeof host - 1);
-    return std::string(host) + "-" + std::to_string(::getpid());
-}
-
 // The three request topics (and the server's own token) are the levels
 // under the root. One subscription takes them all, so that the broker hands
 // them over in the order each client published them: a client's changes
@@ -57,6 +47,20 @@ NetworkSyncServer::~NetworkSyncServer() {
 // PostgreSQL is built where libpq is (see server/CMakeLists.txt); the
 // rest of this file reaches it only through these two.
 #if TESSARINE_WITH_POSTGRES
+namespace {
+
+constexpr size_t kHostNameBytes = 256;
+
+// The instance's name in the leases: as given, or the host and process.
+std::string instanceIdOf(const NetworkSyncServer::Options& options) {
+    if (!options.instanceId.empty()) return options.instanceId;
+    char host[kHostNameBytes] = {};
+    ::gethostname(host, sizeof host - 1);
+    return std::string(host) + "-" + std::to_string(::getpid());
+}
+
+}  // namespace
+
 std::unique_ptr<LogStorage> NetworkSyncServer::makeStorage(const Options& options) {
     if (options.postgres.empty()) return std::make_unique<SqliteLogStorage>(options.dataPath);
     auto storage = std::make_unique<PostgresLogStorage>(options.postgres, instanceIdOf(options));
