@@ -15,10 +15,9 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <memory>
+#include <functional>
+#include <map>
 #include <string>
-#include <string_view>
-#include <unordered_map>
 #include <vector>
 
 struct sqlite3_stmt;
@@ -45,17 +44,13 @@ public:
 
 private:
     struct Entry {
-        std::string sql;
         std::vector<sqlite3_stmt*> idle;
         uint64_t lastUse = 0;
     };
 
     void evictLeastRecentlyUsed();
 
-    // Keyed by a view of the entry's own text, so that give looks SQLite's
-    // copy of the text up without building a string. SQL texts share long
-    // prefixes, which makes a hash cheaper than an ordered compare.
-    std::unordered_map<std::string_view, std::unique_ptr<Entry>> entries;
+    std::map<std::string, Entry, std::less<>> entries;
     std::size_t idleCount = 0;
     uint64_t useClock = 0;
 };
