@@ -2,6 +2,7 @@
 
 #include <mosquitto.h>
 
+#include <chrono>
 #include <exception>
 #include <stdexcept>
 
@@ -18,11 +19,16 @@ constexpr int kQos = 1;
 // What a SUBACK grants for a subscription the broker refused.
 constexpr int kRefused = 0x80;
 // A refused subscription is asked for again as soon as the refusal comes,
-// up to this many times per connection: a broker that is still electing its
-// leaders (a NATS node that just restarted) refuses for seconds, tens of
-// seconds on a loaded machine, each refusal taking it tens of milliseconds;
-// one that forbids the topic does so forever.
-constexpr int kMaxSubscribeAttempts = 2000;
+// this many times per connection, and then after a pause each time: a
+// broker that is still electing its leaders (a NATS node that just
+// restarted) refuses for seconds, a minute on a loaded machine, each
+// refusal taking it tens of milliseconds; one that forbids the topic does
+// so for good, and is then asked a few times a second, not in a busy loop.
+// Giving up instead would leave the connection up but deaf until it drops.
+constexpr int kImmediateSubscribeAttempts = 100;
+constexpr std::chrono::milliseconds kRefusedSubscriptionPause{200};
+// After the first refusal, one line every this many.
+constexpr int kRefusalsPerLogLine = 100;
 
 void initialiseLibrary() {
     static const int once = mosquitto_lib_init();
@@ -105,6 +111,10 @@ void MqttConnection::start() {
         std::unique_lock<std::shared_mutex> lock(clientMutex);
         client = created;
     }
+    {
+        std::lock_guard<std::mutex> lock(stoppingMutex);
+        stopping = false;
+    }
     started = true;
     require(mosquitto_loop_start(client), name + ": cannot start the network thread");
     // The thread runs first: then a first attempt that fails is retried with
@@ -112,13 +122,19 @@ void MqttConnection::start() {
     // the thread gives up at once).
     int rc = mosquitto_connect_async(client, settings.host.c_str(), settings.port, settings.keepAliveSeconds);
     if (rc != MOSQ_ERR_SUCCESS) {
-        lv_printLog(4, kTag, "%s: cannot connect to %s:%d yet: %s", name.c_str(), settings.host.c_str(),
-                    settings.port, mosquitto_strerror(rc));
+        lv_printLog(LogPriority::kInfo, kTag, "%s: cannot connect to %s:%d yet: %s", name.c_str(),
+                    settings.host.c_str(), settings.port, mosquitto_strerror(rc));
     }
 }
 
 void MqttConnection::stop() {
     if (!started) return;
+    {
+        // Cuts short a pause between refused subscriptions on the thread.
+        std::lock_guard<std::mutex> lock(stoppingMutex);
+        stopping = true;
+    }
+    stoppingWake.notify_all();
     // The thread is joined before the client goes, and without the lock:
     // its handlers may be publishing.
     mosquitto_disconnect(client);
@@ -154,8 +170,8 @@ int MqttConnection::publish(const std::string& topic, const std::vector<unsigned
     int rc = mosquitto_publish(client, &messageId, topic.c_str(), static_cast<int>(payload.size()), payload.data(),
                                kQos, retain);
     if (rc != MOSQ_ERR_SUCCESS) {
-        lv_printLog(5, kTag, "%s: cannot publish %zu bytes on \"%s\": %s", name.c_str(), payload.size(),
-                    topic.c_str(), mosquitto_strerror(rc));
+        lv_printLog(LogPriority::kWarn, kTag, "%s: cannot publish %zu bytes on \"%s\": %s", name.c_str(),
+                    payload.size(), topic.c_str(), mosquitto_strerror(rc));
         return 0;
     }
     return messageId;
@@ -173,7 +189,10 @@ void MqttConnection::onDisconnect(struct mosquitto*, void* self, int rc) {
     auto* connection = static_cast<MqttConnection*>(self);
     connection->connected = false;
     connection->listening = false;
-    if (rc != 0) lv_printLog(4, kTag, "%s: connection lost: %s", connection->name.c_str(), mosquitto_strerror(rc));
+    if (rc != 0) {
+        lv_printLog(LogPriority::kInfo, kTag, "%s: connection lost: %s", connection->name.c_str(),
+                    mosquitto_strerror(rc));
+    }
     if (connection->handlers.disconnected) connection->guard("disconnected", connection->handlers.disconnected);
 }
 
@@ -209,19 +228,25 @@ void MqttConnection::handleSubscribed(struct mosquitto* mosq, int messageId, int
         // server otherwise.
         announce = refusals.empty() && (announce || (awaited.empty() && !announced));
     }
-    if (attempts > 0 && attempts < kMaxSubscribeAttempts) {
-        if (attempts == 1) {
-            lv_printLog(5, kTag, "%s: the broker refused the subscription to \"%s\"; asking again", name.c_str(),
-                        topic.c_str());
-        }
-        requestSubscription(mosq, topic);
+    if (attempts == 0) {
+        if (announce) this->announce();
         return;
     }
-    if (attempts > 0) {
-        lv_printLog(6, kTag, "%s: the broker refused the subscription to \"%s\" %d times; giving up on this connection",
-                    name.c_str(), topic.c_str(), attempts);
+    if (attempts == 1) {
+        lv_printLog(LogPriority::kWarn, kTag, "%s: the broker refused the subscription to \"%s\"; asking again",
+                    name.c_str(), topic.c_str());
+    } else if (attempts % kRefusalsPerLogLine == 0) {
+        lv_printLog(LogPriority::kWarn, kTag,
+                    "%s: the broker refused the subscription to \"%s\" %d times; asking again", name.c_str(),
+                    topic.c_str(), attempts);
     }
-    if (announce) this->announce();
+    if (attempts >= kImmediateSubscribeAttempts && !pauseUnlessStopping(kRefusedSubscriptionPause)) return;
+    requestSubscription(mosq, topic);
+}
+
+bool MqttConnection::pauseUnlessStopping(std::chrono::milliseconds pause) {
+    std::unique_lock<std::mutex> lock(stoppingMutex);
+    return !stoppingWake.wait_for(lock, pause, [this] { return stopping; });
 }
 
 void MqttConnection::onPublish(struct mosquitto*, void* self, int messageId) {
@@ -233,7 +258,7 @@ void MqttConnection::onPublish(struct mosquitto*, void* self, int messageId) {
 
 void MqttConnection::handleConnect(struct mosquitto* mosq, int rc) {
     if (rc != 0) {
-        lv_printLog(5, kTag, "%s: connection refused: %s", name.c_str(), mosquitto_connack_string(rc));
+        lv_printLog(LogPriority::kWarn, kTag, "%s: connection refused: %s", name.c_str(), mosquitto_connack_string(rc));
         return;
     }
     {
@@ -253,7 +278,7 @@ void MqttConnection::handleConnect(struct mosquitto* mosq, int rc) {
         subscribed = topics;
     }
     for (const std::string& topic : subscribed) requestSubscription(mosq, topic);
-    lv_printLog(4, kTag, "%s: connected to %s:%d", name.c_str(), settings.host.c_str(), settings.port);
+    lv_printLog(LogPriority::kInfo, kTag, "%s: connected to %s:%d", name.c_str(), settings.host.c_str(), settings.port);
     // The answers come on this thread, after this returns.
     if (subscribed.empty()) announce();
 }
@@ -270,8 +295,8 @@ void MqttConnection::announce() {
 void MqttConnection::handleMessage(const struct mosquitto_message& message) {
     size_t size = static_cast<size_t>(message.payloadlen);
     if (size > settings.maxPayloadBytes) {
-        lv_printLog(5, kTag, "%s: dropped a payload of %zu bytes on \"%s\": larger than %zu bytes", name.c_str(), size,
-                    message.topic, settings.maxPayloadBytes);
+        lv_printLog(LogPriority::kWarn, kTag, "%s: dropped a payload of %zu bytes on \"%s\": larger than %zu bytes",
+                    name.c_str(), size, message.topic, settings.maxPayloadBytes);
         return;
     }
     if (!handlers.message) return;
@@ -284,9 +309,9 @@ void MqttConnection::guard(const char* what, const std::function<void()>& body) 
     try {
         body();
     } catch (const std::exception& e) {
-        lv_printLog(6, kTag, "%s: the %s handler failed: %s", name.c_str(), what, e.what());
+        lv_printLog(LogPriority::kError, kTag, "%s: the %s handler failed: %s", name.c_str(), what, e.what());
     } catch (...) {
-        lv_printLog(6, kTag, "%s: the %s handler failed", name.c_str(), what);
+        lv_printLog(LogPriority::kError, kTag, "%s: the %s handler failed", name.c_str(), what);
     }
 }
 

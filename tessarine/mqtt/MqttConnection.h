@@ -9,18 +9,19 @@
 //     subscription, so that what is published from here on reaches this
 //     client; and again when a subscription the broker refused is granted
 //     after all (what was published to it meanwhile is lost, as when a
-//     connection drops). A connection that gave up asking for a refused
-//     subscription is never announced;
+//     connection drops);
 //   - message: a message arrived on a subscribed topic (retained: the broker
 //     kept it from before this connection's subscription);
 //   - published: the broker acknowledged the publish with that message id;
 //   - disconnected: the connection went down (or an attempt failed).
 // An exception a handler throws is logged and goes no further. A
 // subscription the broker refuses (a NATS node whose JetStream is not ready
-// yet) is asked for again, up to a limit per connection (the first refusal
-// and giving up are logged). A refused connection (bad credentials, say) is
-// logged under the connection's name ("<name>: connection refused:
-// <reason>") and tried again after the back-off.
+// yet) is asked for again until it is granted or the connection drops: at
+// once at first, then after a short pause on the network thread, which
+// stop() cuts short (the first refusal and every hundredth are logged). A
+// refused connection (bad credentials, say) is logged under the
+// connection's name ("<name>: connection refused: <reason>") and tried
+// again after the back-off.
 //
 // Threads: every operation may be called from any thread, handlers
 // included, except that start() and stop() must not run at the same time.
@@ -32,6 +33,8 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
+#include <condition_variable>
 #include <functional>
 #include <map>
 #include <mutex>
@@ -109,8 +112,7 @@ public:
     bool isConnected() const;
     // Connected with every subscription granted: what the broker delivers to
     // the subscribed topics reaches the message handler. False from a
-    // refusal until the subscription is granted again, and for good on a
-    // connection that gave up asking.
+    // refusal until the subscription is granted.
     bool isListening() const;
 
     const ConnectionOptions& options() const { return settings; }
@@ -129,6 +131,8 @@ private:
     // Asks again for a subscription the broker refused; announces the
     // connection once every subscription is answered.
     void handleSubscribed(struct mosquitto* mosq, int messageId, int granted);
+    // Waits for pause unless stop() is under way; false if it is.
+    bool pauseUnlessStopping(std::chrono::milliseconds pause);
     // Runs the connected handler.
     void announce();
     void handleConnect(struct mosquitto* mosq, int rc);
@@ -148,6 +152,10 @@ private:
     std::atomic<bool> connected{false};
     std::atomic<bool> listening{false};
     bool started = false;
+
+    std::mutex stoppingMutex;  // guards stopping; taken by the pause and by start() and stop() only
+    std::condition_variable stoppingWake;
+    bool stopping = false;
 
     std::mutex topicsMutex;  // guards topics; taken briefly, never across a handler
     std::set<std::string> topics;
