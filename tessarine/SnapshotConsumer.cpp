@@ -29,7 +29,7 @@ void SnapshotConsumer::onSnapshotReceived(const SyncProtocol::Snapshot& snapshot
         deltas.reserve(snapshot.objects.size());
         for (const SyncProtocol::TessarineObject& object : snapshot.objects) {
             SyncProtocol::Delta delta;
-            delta.clientId = snapshotClientId;
+            delta.clientId = kClientId;
             delta.collectionName = collectionName;
             delta.versionId = 0;
             delta.primaryKey = object.primaryKey;
