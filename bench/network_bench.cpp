@@ -78,8 +78,8 @@ struct Store {
     std::unique_ptr<ts::Collection> collection;
 };
 
-ts::mqtt::ConnectionOptions brokerOptions(int port) {
-    ts::mqtt::ConnectionOptions options;
+ts::mqtt::MqttTransport::Options brokerOptions(int port) {
+    ts::mqtt::MqttTransport::Options options;
     options.port = port;
     return options;
 }

@@ -36,8 +36,8 @@ const std::chrono::seconds kSetupDeadline(60);
 
 std::string collectionName(int i) { return "tier:c" + std::to_string(i); }
 
-ts::mqtt::ConnectionOptions brokerOptions(int port) {
-    ts::mqtt::ConnectionOptions options;
+ts::mqtt::MqttTransport::Options brokerOptions(int port) {
+    ts::mqtt::MqttTransport::Options options;
     options.port = port;
     options.maxReconnectDelaySeconds = 1;
     return options;

@@ -316,8 +316,8 @@ TEST_F(ClusteredBrokerTest, ClientTopicsCarryAnyClientIdAcrossNodes) {
 // can be read.
 class EmbeddedSyncTest : public ::testing::Test {
 protected:
-    ts::mqtt::ConnectionOptions brokerOptions(const std::string& user = "", const std::string& password = "") {
-        ts::mqtt::ConnectionOptions options;
+    ts::mqtt::MqttTransport::Options brokerOptions(const std::string& user = "", const std::string& password = "") {
+        ts::mqtt::MqttTransport::Options options;
         options.port = broker.port;
         options.maxReconnectDelaySeconds = 1;
         options.username = user;
@@ -334,7 +334,7 @@ protected:
         std::unique_ptr<ts::Tessarine> store;
         std::unique_ptr<ts::Collection> notes;
     };
-    Store openStore(const ts::mqtt::ConnectionOptions& options, const std::string& name) {
+    Store openStore(const ts::mqtt::MqttTransport::Options& options, const std::string& name) {
         Store opened;
         opened.transport = std::make_shared<ts::mqtt::MqttTransport>(options);
         opened.store = ts::Tessarine::open(dir.file(name + ".db"), opened.transport,
@@ -360,7 +360,7 @@ protected:
 
 TEST_F(EmbeddedSyncTest, HostilePayloadsOnEveryTopicAreDroppedAndServingGoesOn) {
     broker.start();
-    ts::mqtt::ConnectionOptions options = brokerOptions("device", "s3cret");
+    ts::mqtt::MqttTransport::Options options = brokerOptions("device", "s3cret");
     options.maxPayloadBytes = 4096;
     startServer(options);
 
@@ -446,6 +446,45 @@ TEST_F(EmbeddedSyncTest, HostilePayloadsOnEveryTopicAreDroppedAndServingGoesOn) 
     EXPECT_EQ(0u, server->rules().sequenceNumber("not a valid name!"));
 }
 
+// A broker in trouble may lose what it had acknowledged (the server's token,
+// the store's changes): a store that hears nothing back asks again, each
+// time subscribing before it resends.
+TEST_F(EmbeddedSyncTest, StoreThatHearsNothingBackSubscribesAndResendsAgain) {
+    broker.start();
+    std::mutex mutex;
+    std::vector<std::string> heard;  // topics, and "change <version>" for changes
+    ts::mqtt::MqttConnection silentServer(
+        brokerOptions("device", "s3cret"), "silent server",
+        {nullptr,
+         [&](const std::string& topic, std::vector<unsigned char> payload, bool) {
+             bool change = topic == ts::protocol::TOPIC_CHANGE_RECORD;
+             std::lock_guard<std::mutex> lock(mutex);
+             heard.push_back(change ? "change " + std::to_string(ts::protocol::makeTessarineDelta(payload, 0).versionId)
+                                    : topic);
+         },
+         nullptr, nullptr});
+    silentServer.subscribe("/+");
+    silentServer.start();
+    ASSERT_TRUE(waitUntil([&] { return silentServer.isListening(); }));
+
+    auto options = brokerOptions("device", "s3cret");
+    options.resendAfterSilence = std::chrono::milliseconds(50);
+    Store store = openStore(options, "store");
+    store.notes->saveObject("k", "k", {1});
+    std::vector<std::string> seen;
+    ASSERT_TRUE(waitUntil([&] {
+        std::lock_guard<std::mutex> lock(mutex);
+        seen = heard;
+        return std::count(seen.begin(), seen.end(), "change 1") >= 3;
+    }));
+    auto first = std::find(seen.begin(), seen.end(), "change 1");
+    for (auto entry = first + 1; entry != seen.end(); ++entry) {
+        if (*entry == "change 1") {
+            EXPECT_EQ(ts::protocol::TOPIC_SUBSCRIBE_COLLECTION, *(entry - 1));
+        }
+    }
+}
+
 TEST_F(EmbeddedSyncTest, BrokerRequiringCredentialsRefusesAnUnauthenticatedStore) {
     broker.start();
     startServer(brokerOptions("device", "s3cret"));
@@ -462,7 +501,7 @@ TEST_F(EmbeddedSyncTest, BrokerRequiringCredentialsRefusesAnUnauthenticatedStore
 TEST_F(EmbeddedSyncTest, TlsBrokerServesStoresThatCheckItsCertificate) {
     MqttBroker tlsBroker(dir, {"", "", true});
     tlsBroker.start();
-    ts::mqtt::ConnectionOptions options;
+    ts::mqtt::MqttTransport::Options options;
     options.port = tlsBroker.port;
     options.caFile = tlsBroker.caFile;
     options.maxReconnectDelaySeconds = 1;

@@ -1,5 +1,6 @@
 #include "tessarine/mqtt/MqttTransport.h"
 
+#include <algorithm>
 #include <exception>
 
 #include "platform/Log.h"
@@ -18,7 +19,9 @@ thread_local bool resynchronising = false;
 }  // namespace
 
 MqttTransport::MqttTransport(const Options& options)
-    : connection(options, kName,
+    : resendAfterSilence(options.resendAfterSilence),
+      silenceAllowed(options.resendAfterSilence),
+      connection(options, kName,
                  MqttConnection::Handlers{
                      [this] { handleConnected(); },
                      [this](const std::string& topic, std::vector<unsigned char> payload, bool retained) {
@@ -27,9 +30,42 @@ MqttTransport::MqttTransport(const Options& options)
                      [this](int messageId) { handlePublished(messageId); },
                      [this] { handleDisconnected(); }}) {
     connection.subscribe(TOPIC_SERVER_ONLINE);
+    watch = std::thread([this] { watchForSilence(); });
 }
 
-MqttTransport::~MqttTransport() = default;
+MqttTransport::~MqttTransport() {
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        stopping = true;
+    }
+    stoppingWake.notify_all();
+    watch.join();
+}
+
+void MqttTransport::watchForSilence() {
+    // Often enough that a silence is noticed within a quarter of its limit.
+    const auto period = std::min<std::chrono::milliseconds>(resendAfterSilence / 4, std::chrono::seconds(1));
+    std::unique_lock<std::mutex> lock(mutex);
+    while (!stoppingWake.wait_for(lock, period, [this] { return stopping; })) {
+        if (!silenceCalledForResend(std::chrono::steady_clock::now())) continue;
+        ready = false;
+        lock.unlock();
+        lv_printLog(LogPriority::kInfo, kTag, "%s: no answer from the server: subscribing and resending", kName);
+        try {
+            resynchronise();
+        } catch (const std::exception& e) {
+            lv_printLog(LogPriority::kError, kTag, "%s: cannot resynchronise: %s", kName, e.what());
+        }
+        lock.lock();
+    }
+}
+
+bool MqttTransport::silenceCalledForResend(std::chrono::steady_clock::time_point now) {
+    if (!ready || !unansweredSince || now - *unansweredSince < silenceAllowed) return false;
+    unansweredSince.reset();
+    silenceAllowed = std::min(silenceAllowed * 2, kMaxResendAfterSilence);
+    return true;
+}
 
 void MqttTransport::start() { connection.start(); }
 
@@ -52,7 +88,7 @@ void MqttTransport::sendSubscriptionRequest(const SubscriptionRequest& request) 
         listenAs(request.clientId);
         connection.publish(protocol::TOPIC_SUBSCRIBE_COLLECTION, protocol::makePayloadForSubscription(request));
     } catch (const std::exception& e) {
-        lv_printLog(6, kTag, "%s: cannot send a subscription: %s", kName, e.what());
+        lv_printLog(LogPriority::kError, kTag, "%s: cannot send a subscription: %s", kName, e.what());
     }
 }
 
@@ -67,7 +103,7 @@ int MqttTransport::sendDelta(const Delta& delta) {
         }
         return publishChange(delta) != 0 ? 1 : 0;
     } catch (const std::exception& e) {
-        lv_printLog(6, kTag, "%s: cannot send a change: %s", kName, e.what());
+        lv_printLog(LogPriority::kError, kTag, "%s: cannot send a change: %s", kName, e.what());
         return 0;
     }
 }
@@ -76,7 +112,9 @@ int MqttTransport::publishChange(const Delta& delta) {
     // Called with the lock held, so that the acknowledgement, which can come
     // back before publish returns, finds the change.
     int messageId = connection.publish(protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta));
-    if (messageId != 0) unacknowledged[messageId] = delta;
+    if (messageId == 0) return 0;
+    unacknowledged[messageId] = delta;
+    if (!unansweredSince) unansweredSince = std::chrono::steady_clock::now();
     return messageId;
 }
 
@@ -85,7 +123,7 @@ void MqttTransport::sendSnapshotRequest(const std::string& collectionName, const
         listenAs(clientId);
         connection.publish(protocol::TOPIC_SNAPSHOT, protocol::makePayloadForSnapshotRequest(collectionName, clientId));
     } catch (const std::exception& e) {
-        lv_printLog(6, kTag, "%s: cannot send a snapshot request: %s", kName, e.what());
+        lv_printLog(LogPriority::kError, kTag, "%s: cannot send a snapshot request: %s", kName, e.what());
     }
 }
 
@@ -102,13 +140,16 @@ void MqttTransport::handleConnected() {
 
 void MqttTransport::handleDisconnected() {
     // Held changes stay queued in the store, which resends them on the next
-    // connection.
+    // connection; silence is measured afresh from there.
     std::lock_guard<std::mutex> lock(mutex);
     ready = false;
     held.clear();
+    unansweredSince.reset();
+    silenceAllowed = resendAfterSilence;
 }
 
 void MqttTransport::resynchronise() {
+    std::lock_guard<std::mutex> resynchronisingLock(resynchronisingMutex);
     resynchronising = true;
     try {
         onConnectionEstablished();
@@ -143,11 +184,16 @@ void MqttTransport::handleServerOnline(const std::vector<unsigned char>& payload
         if (retained) return;
         ready = false;
     }
-    lv_printLog(4, kTag, "%s: the server is online (%s): subscribing and resending", kName, token.c_str());
+    lv_printLog(LogPriority::kInfo, kTag, "%s: the server is online (%s): subscribing and resending", kName, token.c_str());
     resynchronise();
 }
 
 void MqttTransport::handleServerPayload(const std::vector<unsigned char>& payload) {
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        unansweredSince.reset();
+        silenceAllowed = resendAfterSilence;
+    }
     ServerPayload serverPayload;
     std::vector<Delta> deltas;
     Snapshot snapshot;
@@ -159,7 +205,7 @@ void MqttTransport::handleServerPayload(const std::vector<unsigned char>& payloa
             snapshot = protocol::deserializeSnapshot(serverPayload.data);
         }
     } catch (const std::exception& e) {
-        lv_printLog(5, kTag, "%s: dropped a server payload of %zu bytes: %s", kName, payload.size(), e.what());
+        lv_printLog(LogPriority::kWarn, kTag, "%s: dropped a server payload of %zu bytes: %s", kName, payload.size(), e.what());
         return;
     }
     if (serverPayload.type == PayloadType::DELTA_LIST) {

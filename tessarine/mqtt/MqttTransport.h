@@ -36,21 +36,35 @@
 // server's echo of the change, which the server sends only after its commit.
 // (A broker can lose messages it acknowledged when it is killed.)
 //
+// Silence: a broker in trouble (a NATS node dying) may lose what it had
+// acknowledged, the store's changes as well as the server's answers and its
+// new token. So when changes went out and nothing at all has come back from
+// the server for Options::resendAfterSilence, the transport resynchronises as
+// on a new server (subscriptions, then the queue), and waits twice as long
+// before the next such attempt, up to kMaxResendAfterSilence; anything the
+// server sends resets the wait. A server that is merely slow gets a resend it
+// answers with echoes.
+//
 // Bad input: a server payload that does not parse, or is larger than
 // Options::maxPayloadBytes, is logged (priority 5, tag "tessarine") and
 // dropped; nothing reaches the store.
 //
 // Threads: every operation may be called from any thread; none blocks on the
 // network and sendDelta never throws. The on... events run on the
-// connection's network thread, never under a lock of the transport. The
-// destructor joins that thread: do not destroy the transport inside a store
-// callback.
+// connection's network thread, never under a lock of the transport, except
+// that a resynchronisation after silence runs on the transport's watch
+// thread; resynchronisations never overlap. The destructor joins both
+// threads: do not destroy the transport inside a store callback.
 #pragma once
 
+#include <chrono>
+#include <condition_variable>
 #include <map>
 #include <mutex>
+#include <optional>
 #include <set>
 #include <string>
+#include <thread>
 
 #include "tessarine/SyncProtocol.h"
 #include "tessarine/mqtt/MqttConnection.h"
@@ -61,7 +75,13 @@ namespace mqtt {
 
 class MqttTransport : public SyncProtocol {
 public:
-    using Options = ConnectionOptions;
+    static constexpr std::chrono::milliseconds kMaxResendAfterSilence{std::chrono::minutes(2)};
+
+    struct Options : ConnectionOptions {
+        // How long the server may stay silent after a change went out
+        // before the transport resynchronises (see Silence, above).
+        std::chrono::milliseconds resendAfterSilence{std::chrono::seconds(10)};
+    };
 
     // Throws std::runtime_error for options that cannot be used.
     explicit MqttTransport(const Options& options);
@@ -86,13 +106,22 @@ private:
     // Publishes a change and remembers it for its acknowledgement; the lock is held.
     int publishChange(const Delta& delta);
     // Lets the store subscribe and resend, then publishes the held changes.
+    // Takes resynchronisingMutex, then mutex.
     void resynchronise();
+    // The watch thread: resynchronises when the server stays silent.
+    void watchForSilence();
+    // True, once, when a silence has lasted long enough; mutex is held.
+    bool silenceCalledForResend(std::chrono::steady_clock::time_point now);
     void handleConnected();
     void handleDisconnected();
     void handleMessage(const std::string& topic, const std::vector<unsigned char>& payload, bool retained);
     void handleServerOnline(const std::vector<unsigned char>& payload, bool retained);
     void handleServerPayload(const std::vector<unsigned char>& payload);
     void handlePublished(int messageId);
+
+    const std::chrono::milliseconds resendAfterSilence;
+    // Held across a whole resynchronisation, before mutex.
+    std::mutex resynchronisingMutex;
 
     std::mutex mutex;  // guards the members below; never held across an on... call
     std::set<std::string> clientIds;
@@ -102,8 +131,15 @@ private:
     // resynchronised; meanwhile the application's changes wait in held.
     bool ready = false;
     std::vector<Delta> held;
+    // Since when a change has gone out without anything from the server
+    // after it; empty when answered.
+    std::optional<std::chrono::steady_clock::time_point> unansweredSince;
+    std::chrono::milliseconds silenceAllowed;
+    bool stopping = false;
+    std::condition_variable stoppingWake;
 
-    MqttConnection connection;  // last: its thread calls into the members above
+    MqttConnection connection;  // its thread calls into the members above
+    std::thread watch;          // last: joined by the destructor before anything goes
 };
 
 }  // namespace mqtt
