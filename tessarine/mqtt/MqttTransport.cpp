@@ -5,13 +5,13 @@
 
 #include "platform/Log.h"
 #include "tessarine/Protocol.h"
+#include "tessarine/StoreLog.h"
 
 namespace lumivale {
 namespace tessarine {
 namespace mqtt {
 
 namespace {
-constexpr const char* kTag = "tessarine";
 constexpr const char* kName = "MqttTransport";
 // True on the network thread while the store resynchronises: its resends go
 // straight out.
@@ -19,8 +19,8 @@ thread_local bool resynchronising = false;
 }  // namespace
 
 MqttTransport::MqttTransport(const Options& options)
-    : resendAfterSilence(options.resendAfterSilence),
-      silenceAllowed(options.resendAfterSilence),
+    : resendUnansweredAfter(options.resendUnansweredAfter),
+      unansweredAllowed(options.resendUnansweredAfter),
       connection(options, kName,
                  MqttConnection::Handlers{
                      [this] { handleConnected(); },
@@ -30,7 +30,7 @@ MqttTransport::MqttTransport(const Options& options)
                      [this](int messageId) { handlePublished(messageId); },
                      [this] { handleDisconnected(); }}) {
     connection.subscribe(TOPIC_SERVER_ONLINE);
-    watch = std::thread([this] { watchForSilence(); });
+    watch = std::thread([this] { watchForUnanswered(); });
 }
 
 MqttTransport::~MqttTransport() {
@@ -42,29 +42,35 @@ MqttTransport::~MqttTransport() {
     watch.join();
 }
 
-void MqttTransport::watchForSilence() {
-    // Often enough that a silence is noticed within a quarter of its limit.
-    const auto period = std::min<std::chrono::milliseconds>(resendAfterSilence / 4, std::chrono::seconds(1));
+void MqttTransport::watchForUnanswered() {
+    // Often enough that a due resend is noticed within a quarter of the wait.
+    const auto period = std::min<std::chrono::milliseconds>(resendUnansweredAfter / 4, std::chrono::seconds(1));
     std::unique_lock<std::mutex> lock(mutex);
     while (!stoppingWake.wait_for(lock, period, [this] { return stopping; })) {
-        if (!silenceCalledForResend(std::chrono::steady_clock::now())) continue;
+        if (!resendDue(std::chrono::steady_clock::now())) continue;
         ready = false;
         lock.unlock();
-        lv_printLog(LogPriority::kInfo, kTag, "%s: no answer from the server: subscribing and resending", kName);
+        lv_printLog(LogPriority::kInfo, kStoreLogTag, "%s: changes unanswered by the server: subscribing and resending", kName);
         try {
             resynchronise();
         } catch (const std::exception& e) {
-            lv_printLog(LogPriority::kError, kTag, "%s: cannot resynchronise: %s", kName, e.what());
+            lv_printLog(LogPriority::kError, kStoreLogTag, "%s: cannot resynchronise: %s", kName, e.what());
         }
         lock.lock();
     }
 }
 
-bool MqttTransport::silenceCalledForResend(std::chrono::steady_clock::time_point now) {
-    if (!ready || !unansweredSince || now - *unansweredSince < silenceAllowed) return false;
-    unansweredSince.reset();
-    silenceAllowed = std::min(silenceAllowed * 2, kMaxResendAfterSilence);
+bool MqttTransport::resendDue(std::chrono::steady_clock::time_point now) {
+    if (!ready || !unansweredSince || now - *unansweredSince < unansweredAllowed) return false;
+    unansweredAllowed = std::min(unansweredAllowed * 2, kMaxResendUnansweredAfter);
     return true;
+}
+
+void MqttTransport::answered(size_t echoes) {
+    unanswered -= std::min(unanswered, echoes);
+    if (unanswered > 0) return;
+    unansweredSince.reset();
+    unansweredAllowed = resendUnansweredAfter;
 }
 
 void MqttTransport::start() { connection.start(); }
@@ -88,7 +94,7 @@ void MqttTransport::sendSubscriptionRequest(const SubscriptionRequest& request) 
         listenAs(request.clientId);
         connection.publish(protocol::TOPIC_SUBSCRIBE_COLLECTION, protocol::makePayloadForSubscription(request));
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, kTag, "%s: cannot send a subscription: %s", kName, e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "%s: cannot send a subscription: %s", kName, e.what());
     }
 }
 
@@ -103,7 +109,7 @@ int MqttTransport::sendDelta(const Delta& delta) {
         }
         return publishChange(delta) != 0 ? 1 : 0;
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, kTag, "%s: cannot send a change: %s", kName, e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "%s: cannot send a change: %s", kName, e.what());
         return 0;
     }
 }
@@ -114,7 +120,7 @@ int MqttTransport::publishChange(const Delta& delta) {
     int messageId = connection.publish(protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta));
     if (messageId == 0) return 0;
     unacknowledged[messageId] = delta;
-    if (!unansweredSince) unansweredSince = std::chrono::steady_clock::now();
+    if (unanswered++ == 0) unansweredSince = std::chrono::steady_clock::now();
     return messageId;
 }
 
@@ -123,7 +129,7 @@ void MqttTransport::sendSnapshotRequest(const std::string& collectionName, const
         listenAs(clientId);
         connection.publish(protocol::TOPIC_SNAPSHOT, protocol::makePayloadForSnapshotRequest(collectionName, clientId));
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, kTag, "%s: cannot send a snapshot request: %s", kName, e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "%s: cannot send a snapshot request: %s", kName, e.what());
     }
 }
 
@@ -140,16 +146,21 @@ void MqttTransport::handleConnected() {
 
 void MqttTransport::handleDisconnected() {
     // Held changes stay queued in the store, which resends them on the next
-    // connection; silence is measured afresh from there.
+    // connection; the wait for answers starts again there.
     std::lock_guard<std::mutex> lock(mutex);
     ready = false;
     held.clear();
-    unansweredSince.reset();
-    silenceAllowed = resendAfterSilence;
+    answered(unanswered);
 }
 
 void MqttTransport::resynchronise() {
     std::lock_guard<std::mutex> resynchronisingLock(resynchronisingMutex);
+    {
+        // Everything unanswered goes again now, and is counted again.
+        std::lock_guard<std::mutex> lock(mutex);
+        unanswered = 0;
+        unansweredSince.reset();
+    }
     resynchronising = true;
     try {
         onConnectionEstablished();
@@ -184,16 +195,11 @@ void MqttTransport::handleServerOnline(const std::vector<unsigned char>& payload
         if (retained) return;
         ready = false;
     }
-    lv_printLog(LogPriority::kInfo, kTag, "%s: the server is online (%s): subscribing and resending", kName, token.c_str());
+    lv_printLog(LogPriority::kInfo, kStoreLogTag, "%s: the server is online (%s): subscribing and resending", kName, token.c_str());
     resynchronise();
 }
 
 void MqttTransport::handleServerPayload(const std::vector<unsigned char>& payload) {
-    {
-        std::lock_guard<std::mutex> lock(mutex);
-        unansweredSince.reset();
-        silenceAllowed = resendAfterSilence;
-    }
     ServerPayload serverPayload;
     std::vector<Delta> deltas;
     Snapshot snapshot;
@@ -205,8 +211,18 @@ void MqttTransport::handleServerPayload(const std::vector<unsigned char>& payloa
             snapshot = protocol::deserializeSnapshot(serverPayload.data);
         }
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kWarn, kTag, "%s: dropped a server payload of %zu bytes: %s", kName, payload.size(), e.what());
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "%s: dropped a server payload of %zu bytes: %s", kName,
+                    payload.size(), e.what());
         return;
+    }
+    {
+        std::lock_guard<std::mutex> lock(mutex);
+        if (serverPayload.type == PayloadType::DELTA_LIST) {
+            answered(std::count_if(deltas.begin(), deltas.end(),
+                                   [this](const Delta& delta) { return clientIds.count(delta.clientId) != 0; }));
+        } else {
+            answered(unanswered);  // a snapshot persists whatever of ours it holds
+        }
     }
     if (serverPayload.type == PayloadType::DELTA_LIST) {
         onDeltaReceived(deltas);

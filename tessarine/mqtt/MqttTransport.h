@@ -36,14 +36,15 @@
 // server's echo of the change, which the server sends only after its commit.
 // (A broker can lose messages it acknowledged when it is killed.)
 //
-// Silence: a broker in trouble (a NATS node dying) may lose what it had
-// acknowledged, the store's changes as well as the server's answers and its
-// new token. So when changes went out and nothing at all has come back from
-// the server for Options::resendAfterSilence, the transport resynchronises as
-// on a new server (subscriptions, then the queue), and waits twice as long
-// before the next such attempt, up to kMaxResendAfterSilence; anything the
-// server sends resets the wait. A server that is merely slow gets a resend it
-// answers with echoes.
+// Unanswered changes: a broker in trouble (a NATS node dying) may lose what
+// it had acknowledged, the store's changes as well as the server's echoes
+// and its new token. So the transport counts the changes it publishes
+// against the echoes of this store's changes it receives; when some have
+// stayed unanswered for Options::resendUnansweredAfter, it resynchronises as
+// on a new server (subscriptions, then the queue) and waits twice as long
+// before the next such attempt, up to kMaxResendUnansweredAfter; once every
+// change is answered the wait is back to the option. A server that is merely
+// slow gets a resend it answers with echoes.
 //
 // Bad input: a server payload that does not parse, or is larger than
 // Options::maxPayloadBytes, is logged (priority 5, tag "tessarine") and
@@ -52,7 +53,7 @@
 // Threads: every operation may be called from any thread; none blocks on the
 // network and sendDelta never throws. The on... events run on the
 // connection's network thread, never under a lock of the transport, except
-// that a resynchronisation after silence runs on the transport's watch
+// that a resynchronisation for unanswered changes runs on the transport's watch
 // thread; resynchronisations never overlap. The destructor joins both
 // threads: do not destroy the transport inside a store callback.
 #pragma once
@@ -75,12 +76,12 @@ namespace mqtt {
 
 class MqttTransport : public SyncProtocol {
 public:
-    static constexpr std::chrono::milliseconds kMaxResendAfterSilence{std::chrono::minutes(2)};
+    static constexpr std::chrono::milliseconds kMaxResendUnansweredAfter{std::chrono::minutes(2)};
 
     struct Options : ConnectionOptions {
-        // How long the server may stay silent after a change went out
-        // before the transport resynchronises (see Silence, above).
-        std::chrono::milliseconds resendAfterSilence{std::chrono::seconds(10)};
+        // How long a change may go unanswered before the transport
+        // resynchronises (see Unanswered changes, above).
+        std::chrono::milliseconds resendUnansweredAfter{std::chrono::seconds(10)};
     };
 
     // Throws std::runtime_error for options that cannot be used.
@@ -108,10 +109,12 @@ private:
     // Lets the store subscribe and resend, then publishes the held changes.
     // Takes resynchronisingMutex, then mutex.
     void resynchronise();
-    // The watch thread: resynchronises when the server stays silent.
-    void watchForSilence();
-    // True, once, when a silence has lasted long enough; mutex is held.
-    bool silenceCalledForResend(std::chrono::steady_clock::time_point now);
+    // The watch thread: resynchronises when changes stay unanswered.
+    void watchForUnanswered();
+    // True, once, when changes have been unanswered long enough; mutex is held.
+    bool resendDue(std::chrono::steady_clock::time_point now);
+    // Counts answers (all when everything is answered, as by a snapshot).
+    void answered(size_t echoes);
     void handleConnected();
     void handleDisconnected();
     void handleMessage(const std::string& topic, const std::vector<unsigned char>& payload, bool retained);
@@ -119,7 +122,7 @@ private:
     void handleServerPayload(const std::vector<unsigned char>& payload);
     void handlePublished(int messageId);
 
-    const std::chrono::milliseconds resendAfterSilence;
+    const std::chrono::milliseconds resendUnansweredAfter;
     // Held across a whole resynchronisation, before mutex.
     std::mutex resynchronisingMutex;
 
@@ -131,10 +134,11 @@ private:
     // resynchronised; meanwhile the application's changes wait in held.
     bool ready = false;
     std::vector<Delta> held;
-    // Since when a change has gone out without anything from the server
-    // after it; empty when answered.
+    // Changes published less own echoes received, and since when that has
+    // been above zero.
+    size_t unanswered = 0;
     std::optional<std::chrono::steady_clock::time_point> unansweredSince;
-    std::chrono::milliseconds silenceAllowed;
+    std::chrono::milliseconds unansweredAllowed;
     bool stopping = false;
     std::condition_variable stoppingWake;
 
