@@ -4,6 +4,7 @@
 
 #include "platform/Log.h"
 #include "tessarine/DeltaHandler.h"
+#include "tessarine/StoreLog.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -44,7 +45,7 @@ std::unique_ptr<Cursor> Collection::query(const std::string& sortKey, int limit,
         return collectionStorage->query(collectionName, sortKey, limit,
                                         direction == CollectionStorage::SortDirection::ASCENDING);
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", kQueryError, e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, kQueryError, e.what());
         return nullptr;
     }
 }
@@ -54,7 +55,7 @@ std::unique_ptr<Cursor> Collection::queryWithIndex(const std::string& indexQuery
     try {
         return collectionStorage->queryWithIndex(collectionName, indexQuery, indexQueryArgs, limit);
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", kQueryError, e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, kQueryError, e.what());
         return nullptr;
     }
 }
@@ -67,7 +68,7 @@ std::unique_ptr<Cursor> Collection::queryWithIndexSorted(const std::string& inde
         return collectionStorage->queryWithIndexSorted(collectionName, indexQuery, indexQueryArgs, sortFieldName,
                                                        direction, limit);
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", kQueryError, e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, kQueryError, e.what());
         return nullptr;
     }
 }
@@ -76,7 +77,7 @@ std::unique_ptr<Cursor> Collection::getObject(const std::string& primaryKey) noe
     try {
         return collectionStorage->getObject(collectionName, primaryKey);
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error while getting object from collection: %s", e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error while getting object from collection: %s", e.what());
         return nullptr;
     }
 }
@@ -85,7 +86,7 @@ bool Collection::saveObject(const std::string& primaryKey, const std::string& so
                             unsigned int blobSize) noexcept {
     const char* const error = "Error while updating object: %s";
     if (blob == nullptr && blobSize != 0) {
-        lv_printLog(LogPriority::kError, "tessarine", error, "the blob has a size but no data");
+        lv_printLog(LogPriority::kError, kStoreLogTag, error, "the blob has a size but no data");
         return false;
     }
     return write(SyncProtocol::DeltaType::SAVE, primaryKey, sortKey, blob, blobSize, error);
@@ -115,7 +116,7 @@ bool Collection::write(SyncProtocol::DeltaType type, const std::string& primaryK
         deltaHandler->addLocalDeltaWithNextVersionId(std::move(delta));
         return true;
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", errorFormat, e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, errorFormat, e.what());
         return false;
     }
 }

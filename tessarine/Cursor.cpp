@@ -4,6 +4,7 @@
 
 #include "platform/Assert.h"
 #include "platform/Log.h"
+#include "tessarine/StoreLog.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -24,7 +25,7 @@ bool Cursor::step() noexcept {
         if (hasCurrentRow) readRow();
     } catch (const std::exception& e) {
         hasCurrentRow = false;
-        lv_printLog(LogPriority::kWarn, "tessarine", "Cursor::step failed: %s", e.what());
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "Cursor::step failed: %s", e.what());
     }
     return hasCurrentRow;
 }

@@ -12,6 +12,7 @@
 #include "tessarine/Lifecycle.h"
 #include "tessarine/SerializedJobQueue.h"
 #include "tessarine/SnapshotConsumer.h"
+#include "tessarine/StoreLog.h"
 #include "tessarine/SubscriptionManager.h"
 #include "tessarine/VersionVectorStorage.h"
 
@@ -99,7 +100,7 @@ void DeltaHandler::postJob(std::function<void()> work) {
     try {
         serializedJobQueue->addJob(SerializedJobQueue::Job{std::move(work)});
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error while adding job to queue: %s", e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error while adding job to queue: %s", e.what());
         lifecycle->stop();
     }
 }
@@ -114,10 +115,10 @@ void DeltaHandler::onDeltaReceived(const std::vector<SyncProtocol::Delta>& delta
     applicable.reserve(deltas.size());
     for (const SyncProtocol::Delta& delta : deltas) {
         if (!isKnownDeltaType(delta.type)) {
-            lv_printLog(LogPriority::kWarn, "tessarine", "Dropping received delta of unknown type: %d",
+            lv_printLog(LogPriority::kWarn, kStoreLogTag, "Dropping received delta of unknown type: %d",
                         static_cast<int>(delta.type));
         } else if (!Collection::isValidCollectionName(delta.collectionName)) {
-            lv_printLog(LogPriority::kWarn, "tessarine", "Dropping received delta for invalid collection name: %s",
+            lv_printLog(LogPriority::kWarn, kStoreLogTag, "Dropping received delta for invalid collection name: %s",
                         delta.collectionName.c_str());
         } else {
             applicable.push_back(delta);
@@ -147,7 +148,7 @@ void DeltaHandler::processDelivery(const std::vector<SyncProtocol::Delta>& delta
             storeDeliveryMarks(marks);
         }, kImmediate);
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kWarn, "tessarine", "Failed to process received deltas: %s", e.what());
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "Failed to process received deltas: %s", e.what());
         throw;
     }
     if (std::find(taken.begin(), taken.end(), false) == taken.end()) {
@@ -166,7 +167,7 @@ void DeltaHandler::processStatusUpdate(const SyncProtocol::Delta& delta, SyncPro
     try {
         database->runInTransaction([&] { recalculateAndUpdateObjectStatus(delta); }, kImmediate);
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error while processing delta status update: %s", e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error while processing delta status update: %s", e.what());
         throw;
     }
     callDeltaCallbacks({delta}, status);
@@ -178,7 +179,7 @@ bool DeltaHandler::processIncomingDelta(const SyncProtocol::Delta& delta, Delive
     // Own echoes always count: an echo of a change logged earlier carries
     // the collection's latest number, which may be one already applied.
     if (!fromSnapshot && delta.clientId != clientId && applied > 0 && delta.sequenceNumber <= applied) {
-        lv_printLog(LogPriority::kDebug, "tessarine", "Skipping a late copy of delta %llu of %s (applied up to %llu)",
+        lv_printLog(LogPriority::kDebug, kStoreLogTag, "Skipping a late copy of delta %llu of %s (applied up to %llu)",
                     static_cast<unsigned long long>(delta.sequenceNumber), delta.collectionName.c_str(),
                     static_cast<unsigned long long>(applied));
         return false;
@@ -249,7 +250,7 @@ CollectionStorage::ObjectStatus DeltaHandler::convToObjectStatus(DeltaQueue::Pen
         case DeltaQueue::PendingStatus::SENT: return CollectionStorage::ObjectStatus::SENT;
         case DeltaQueue::PendingStatus::PERSISTED: return CollectionStorage::ObjectStatus::PERSISTED;
     }
-    lv_printLog(LogPriority::kWarn, "tessarine", "Unknown pending status: %d", static_cast<int>(pendingStatus));
+    lv_printLog(LogPriority::kWarn, kStoreLogTag, "Unknown pending status: %d", static_cast<int>(pendingStatus));
     return CollectionStorage::ObjectStatus::PERSISTED;
 }
 
@@ -271,7 +272,7 @@ void DeltaHandler::notify(const std::vector<CallbackManager::DeltaReceivedCallba
         try {
             callback(deltas);
         } catch (const std::exception& e) {
-            lv_printLog(LogPriority::kWarn, "tessarine", "Exception in delta callback: %s", e.what());
+            lv_printLog(LogPriority::kWarn, kStoreLogTag, "Exception in delta callback: %s", e.what());
         }
     }
 }
@@ -285,13 +286,13 @@ Delta DeltaHandler::convertMQTTDeltaToApiDelta(const SyncProtocol::Delta& delta,
     if (isKnownDeltaType(delta.type)) {
         apiDelta.type = delta.type;
     } else {
-        lv_printLog(LogPriority::kWarn, "tessarine", "Unknown delta type: %d", static_cast<int>(delta.type));
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "Unknown delta type: %d", static_cast<int>(delta.type));
     }
     int statusNumber = static_cast<int>(status);
     if (statusNumber >= 1 && statusNumber <= 3) {
         apiDelta.status = status;
     } else {
-        lv_printLog(LogPriority::kWarn, "tessarine", "Unknow delta status: %d", statusNumber);
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "Unknow delta status: %d", statusNumber);
     }
     return apiDelta;
 }

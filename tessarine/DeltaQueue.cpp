@@ -8,6 +8,7 @@
 #include "tessarine/DeltaQueueStorage.h"
 #include "tessarine/Lifecycle.h"
 #include "tessarine/SerializedJobQueue.h"
+#include "tessarine/StoreLog.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -105,7 +106,7 @@ void DeltaQueue::onDeltaStatusUpdated(const SyncProtocol::DeltaStatusUpdate& upd
     // where every later reader would take it for a broken invariant.
     int statusNumber = static_cast<int>(update.status);
     if (statusNumber < 1 || statusNumber > 3) {
-        lv_printLog(LogPriority::kWarn, "tessarine", "Dropping delta status update with unknown status: %d",
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "Dropping delta status update with unknown status: %d",
                     statusNumber);
         return;
     }
@@ -116,7 +117,7 @@ void DeltaQueue::onDeltaStatusUpdated(const SyncProtocol::DeltaStatusUpdate& upd
             processDeltaStatusUpdate(delta, status);
         }});
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error while adding job to queue: %s", e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error while adding job to queue: %s", e.what());
         lifecycle->stop();
     }
 }
@@ -129,7 +130,7 @@ void DeltaQueue::processDeltaStatusUpdate(const SyncProtocol::Delta& delta, Sync
         database->runInTransaction([&] { result = updateDeltaStatus(delta, status); },
                                    lumivale::sqlite::Database::TransactionType::Immediate);
     } catch (const std::exception&) {
-        lv_printLog(LogPriority::kWarn, "tessarine", "Failed to process delta status update");
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "Failed to process delta status update");
         throw;
     }
     if (result != QUEUE_CHANGED) return;
@@ -141,7 +142,7 @@ void DeltaQueue::onConnectionEstablished() {
     try {
         sender.requestResend();
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error in DeltaQueue::onConnectionEstablished: %s", e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error in DeltaQueue::onConnectionEstablished: %s", e.what());
     }
     sender.sendWaiting();
 }

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "platform/Log.h"
+#include "tessarine/StoreLog.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -24,9 +25,9 @@ bool hand(SyncProtocol& syncProtocol, const SyncProtocol::Delta& delta, bool res
         syncProtocol.sendDelta(delta);
         return true;
     } catch (const std::exception& e) {
-        lv_printLog(priority, "tessarine", format, e.what());
+        lv_printLog(priority, kStoreLogTag, format, e.what());
     } catch (...) {
-        lv_printLog(priority, "tessarine", format, "an exception of unknown type");
+        lv_printLog(priority, kStoreLogTag, format, "an exception of unknown type");
     }
     return false;
 }
@@ -129,7 +130,7 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
         deltaQueueStorage->readDeltasInIdRange(afterId, upToId, kResendChunkSize, chunk.rows);
         for (auto& row : chunk.rows) row.delta.clientId = clientId;
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", kResendError, e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, kResendError, e.what());
         failed = true;
     }
     std::optional<unsigned> completedCount;
@@ -147,7 +148,7 @@ void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {
         }
     }
     if (completedCount) {
-        lv_printLog(LogPriority::kDebug, "tessarine", "DeltaQueue::onConnectionEstablished: sending %u delta(s)",
+        lv_printLog(LogPriority::kDebug, kStoreLogTag, "DeltaQueue::onConnectionEstablished: sending %u delta(s)",
                     *completedCount);
     }
 }

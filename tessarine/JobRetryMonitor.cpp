@@ -1,6 +1,7 @@
 #include "tessarine/JobRetryMonitor.h"
 
 #include "platform/Log.h"
+#include "tessarine/StoreLog.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -30,7 +31,7 @@ void JobRetryMonitor::attemptFailed(const std::string& error) {
         stallReported = true;
         failedFor = millisecondsSince(failingSinceSteady);
     }
-    lv_printLog(LogPriority::kError, "tessarine", "Store stalled: a job has been failing for %lld ms: %s",
+    lv_printLog(LogPriority::kError, kStoreLogTag, "Store stalled: a job has been failing for %lld ms: %s",
                 failedFor, error.c_str());
 }
 
@@ -45,7 +46,7 @@ void JobRetryMonitor::jobEnded(bool succeeded) {
         stallReported = false;
     }
     if (reportRecovery) {
-        lv_printLog(LogPriority::kInfo, "tessarine", "Store recovered: a job succeeded after failing for %lld ms",
+        lv_printLog(LogPriority::kInfo, kStoreLogTag, "Store recovered: a job succeeded after failing for %lld ms",
                     failedFor);
     }
 }

@@ -3,6 +3,7 @@
 #include <stdexcept>
 
 #include "platform/Log.h"
+#include "tessarine/StoreLog.h"
 #include "tessarine/WireFormat.h"
 
 namespace wire = ::tessarine::wire;
@@ -19,10 +20,9 @@ using wireformat::readBytes;
 using wireformat::readText;
 using wireformat::verifiedRoot;
 
-constexpr const char* kTag = "tessarine";
 
 [[noreturn]] void rejectBuffer(const char* logLine, const char* message) {
-    lv_printLog(LogPriority::kError, kTag, "%s", logLine);
+    lv_printLog(LogPriority::kError, kStoreLogTag, "%s", logLine);
     throw std::runtime_error(message);
 }
 

@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "platform/Log.h"
+#include "tessarine/StoreLog.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -120,7 +121,7 @@ std::optional<std::string> SerializedJobQueue::attempt(const Job& job) {
     } catch (const std::exception& e) {
         return std::string(e.what());  // the job has logged what went wrong
     } catch (...) {
-        lv_printLog(LogPriority::kError, "tessarine",
+        lv_printLog(LogPriority::kError, kStoreLogTag,
                     "Job failed with an exception not derived from std::exception; retrying");
         return std::string("an exception not derived from std::exception");
     }

@@ -5,6 +5,7 @@
 
 #include "platform/Log.h"
 #include "tessarine/DeltaQueueStorage.h"
+#include "tessarine/StoreLog.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -41,7 +42,7 @@ void SnapshotConsumer::onSnapshotReceived(const SyncProtocol::Snapshot& snapshot
         }
         syncProtocol->triggerDeltaReceivedCallbacks(deltas);
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error while processing snapshot: %s", e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error while processing snapshot: %s", e.what());
         throw;
     }
 }

@@ -4,6 +4,7 @@
 
 #include "platform/Log.h"
 #include "tessarine/LibraryMetadata.h"
+#include "tessarine/StoreLog.h"
 #include "tessarine/SubscriptionStorage.h"
 
 namespace lumivale {
@@ -55,7 +56,7 @@ std::optional<uint64_t> SubscriptionManager::findSequenceNumber(const std::strin
 }
 
 void SubscriptionManager::onConnectionEstablished() {
-    lv_printLog(LogPriority::kDebug, "tessarine", "SubscriptionManager::onConnectionEstablished is called back");
+    lv_printLog(LogPriority::kDebug, kStoreLogTag, "SubscriptionManager::onConnectionEstablished is called back");
     try {
         for (const Subscription& subscription : subscriptionStorage->getSubscriptions()) {
             sendSubscribeCollectionRequest(subscription.collectionName, subscription.sequenceNumber);

@@ -9,6 +9,7 @@
 #include "sqlite/Database.h"
 #include "sqlite/SQLiteException.h"
 #include "tessarine/Lifecycle.h"
+#include "tessarine/StoreLog.h"
 #include "tessarine/SubscriptionManager.h"
 #include "tessarine/SyncMetricsCollector.h"
 
@@ -21,7 +22,7 @@ std::unique_ptr<Tessarine> Tessarine::open(const std::string& path, std::shared_
         return std::make_unique<Tessarine>(std::move(syncProtocol), std::move(threadCreator),
                                            createSqliteDatabase(path, TessarineOptions()), path);
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error while creating tessarine instance: %s", e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error while creating tessarine instance: %s", e.what());
         return nullptr;
     }
 }
@@ -39,7 +40,7 @@ void Tessarine::start() noexcept { syncProtocol->start(); }
 
 std::unique_ptr<Collection> Tessarine::subscribeCollection(const std::string& collectionName) noexcept {
     if (!Collection::isValidCollectionName(collectionName)) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error subscribing to a collection: Invalid collection name.");
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error subscribing to a collection: Invalid collection name.");
         return nullptr;
     }
     try {
@@ -51,7 +52,7 @@ std::unique_ptr<Collection> Tessarine::subscribeCollection(const std::string& co
         components.subscriptionManager->subscribeCollection(collectionName);
         return collection;
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error while subscribing to collection %s: %s",
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error while subscribing to collection %s: %s",
                     collectionName.c_str(), e.what());
         return nullptr;
     }
@@ -61,7 +62,7 @@ std::optional<SyncMetrics> Tessarine::getSyncMetrics() const noexcept {
     try {
         return components.syncMetrics->read();
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, "tessarine", "Error while reading sync metrics: %s", e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "Error while reading sync metrics: %s", e.what());
         return std::nullopt;
     }
 }

@@ -7,6 +7,7 @@
 #include <stdexcept>
 
 #include "platform/Log.h"
+#include "tessarine/StoreLog.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -14,7 +15,6 @@ namespace mqtt {
 
 namespace {
 
-constexpr const char* kTag = "tessarine";
 constexpr int kQos = 1;
 // What a SUBACK grants for a subscription the broker refused.
 constexpr int kRefused = 0x80;
@@ -122,7 +122,7 @@ void MqttConnection::start() {
     // the thread gives up at once).
     int rc = mosquitto_connect_async(client, settings.host.c_str(), settings.port, settings.keepAliveSeconds);
     if (rc != MOSQ_ERR_SUCCESS) {
-        lv_printLog(LogPriority::kInfo, kTag, "%s: cannot connect to %s:%d yet: %s", name.c_str(),
+        lv_printLog(LogPriority::kInfo, kStoreLogTag, "%s: cannot connect to %s:%d yet: %s", name.c_str(),
                     settings.host.c_str(), settings.port, mosquitto_strerror(rc));
     }
 }
@@ -170,7 +170,7 @@ int MqttConnection::publish(const std::string& topic, const std::vector<unsigned
     int rc = mosquitto_publish(client, &messageId, topic.c_str(), static_cast<int>(payload.size()), payload.data(),
                                kQos, retain);
     if (rc != MOSQ_ERR_SUCCESS) {
-        lv_printLog(LogPriority::kWarn, kTag, "%s: cannot publish %zu bytes on \"%s\": %s", name.c_str(),
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "%s: cannot publish %zu bytes on \"%s\": %s", name.c_str(),
                     payload.size(), topic.c_str(), mosquitto_strerror(rc));
         return 0;
     }
@@ -190,7 +190,7 @@ void MqttConnection::onDisconnect(struct mosquitto*, void* self, int rc) {
     connection->connected = false;
     connection->listening = false;
     if (rc != 0) {
-        lv_printLog(LogPriority::kInfo, kTag, "%s: connection lost: %s", connection->name.c_str(),
+        lv_printLog(LogPriority::kInfo, kStoreLogTag, "%s: connection lost: %s", connection->name.c_str(),
                     mosquitto_strerror(rc));
     }
     if (connection->handlers.disconnected) connection->guard("disconnected", connection->handlers.disconnected);
@@ -233,10 +233,10 @@ void MqttConnection::handleSubscribed(struct mosquitto* mosq, int messageId, int
         return;
     }
     if (attempts == 1) {
-        lv_printLog(LogPriority::kWarn, kTag, "%s: the broker refused the subscription to \"%s\"; asking again",
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "%s: the broker refused the subscription to \"%s\"; asking again",
                     name.c_str(), topic.c_str());
     } else if (attempts % kRefusalsPerLogLine == 0) {
-        lv_printLog(LogPriority::kWarn, kTag,
+        lv_printLog(LogPriority::kWarn, kStoreLogTag,
                     "%s: the broker refused the subscription to \"%s\" %d times; asking again", name.c_str(),
                     topic.c_str(), attempts);
     }
@@ -258,7 +258,7 @@ void MqttConnection::onPublish(struct mosquitto*, void* self, int messageId) {
 
 void MqttConnection::handleConnect(struct mosquitto* mosq, int rc) {
     if (rc != 0) {
-        lv_printLog(LogPriority::kWarn, kTag, "%s: connection refused: %s", name.c_str(), mosquitto_connack_string(rc));
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "%s: connection refused: %s", name.c_str(), mosquitto_connack_string(rc));
         return;
     }
     {
@@ -278,7 +278,7 @@ void MqttConnection::handleConnect(struct mosquitto* mosq, int rc) {
         subscribed = topics;
     }
     for (const std::string& topic : subscribed) requestSubscription(mosq, topic);
-    lv_printLog(LogPriority::kInfo, kTag, "%s: connected to %s:%d", name.c_str(), settings.host.c_str(), settings.port);
+    lv_printLog(LogPriority::kInfo, kStoreLogTag, "%s: connected to %s:%d", name.c_str(), settings.host.c_str(), settings.port);
     // The answers come on this thread, after this returns.
     if (subscribed.empty()) announce();
 }
@@ -295,7 +295,7 @@ void MqttConnection::announce() {
 void MqttConnection::handleMessage(const struct mosquitto_message& message) {
     size_t size = static_cast<size_t>(message.payloadlen);
     if (size > settings.maxPayloadBytes) {
-        lv_printLog(LogPriority::kWarn, kTag, "%s: dropped a payload of %zu bytes on \"%s\": larger than %zu bytes",
+        lv_printLog(LogPriority::kWarn, kStoreLogTag, "%s: dropped a payload of %zu bytes on \"%s\": larger than %zu bytes",
                     name.c_str(), size, message.topic, settings.maxPayloadBytes);
         return;
     }
@@ -309,9 +309,9 @@ void MqttConnection::guard(const char* what, const std::function<void()>& body) 
     try {
         body();
     } catch (const std::exception& e) {
-        lv_printLog(LogPriority::kError, kTag, "%s: the %s handler failed: %s", name.c_str(), what, e.what());
+        lv_printLog(LogPriority::kError, kStoreLogTag, "%s: the %s handler failed: %s", name.c_str(), what, e.what());
     } catch (...) {
-        lv_printLog(LogPriority::kError, kTag, "%s: the %s handler failed", name.c_str(), what);
+        lv_printLog(LogPriority::kError, kStoreLogTag, "%s: the %s handler failed", name.c_str(), what);
     }
 }
 
