@@ -61,16 +61,22 @@ void MqttTransport::watchForUnanswered() {
 }
 
 bool MqttTransport::resendDue(std::chrono::steady_clock::time_point now) {
-    if (!ready || !unansweredSince || now - *unansweredSince < unansweredAllowed) return false;
+    std::optional<std::chrono::steady_clock::time_point> oldest = unanswered.oldest();
+    if (!ready || !oldest || now - *oldest < unansweredAllowed) return false;
     unansweredAllowed = std::min(unansweredAllowed * 2, kMaxResendUnansweredAfter);
     return true;
 }
 
-void MqttTransport::answered(size_t echoes) {
-    unanswered -= std::min(unanswered, echoes);
-    if (unanswered > 0) return;
-    unansweredSince.reset();
-    unansweredAllowed = resendUnansweredAfter;
+void MqttTransport::noteAnswers(const std::vector<Delta>& deltas) {
+    for (const Delta& delta : deltas) {
+        if (clientIds.count(delta.clientId) != 0) unanswered.answered(delta.collectionName, delta.versionId);
+    }
+    if (unanswered.empty()) unansweredAllowed = resendUnansweredAfter;
+}
+
+void MqttTransport::noteAnswers(const Snapshot& snapshot) {
+    unanswered.answeredUpTo(snapshot.collectionName, snapshot.versionId);
+    if (unanswered.empty()) unansweredAllowed = resendUnansweredAfter;
 }
 
 void MqttTransport::start() { connection.start(); }
@@ -120,7 +126,7 @@ int MqttTransport::publishChange(const Delta& delta) {
     int messageId = connection.publish(protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta));
     if (messageId == 0) return 0;
     unacknowledged[messageId] = delta;
-    if (unanswered++ == 0) unansweredSince = std::chrono::steady_clock::now();
+    unanswered.published(delta.collectionName, delta.versionId, std::chrono::steady_clock::now());
     return messageId;
 }
 
@@ -150,16 +156,16 @@ void MqttTransport::handleDisconnected() {
     std::lock_guard<std::mutex> lock(mutex);
     ready = false;
     held.clear();
-    answered(unanswered);
+    unanswered.clear();
+    unansweredAllowed = resendUnansweredAfter;
 }
 
 void MqttTransport::resynchronise() {
     std::lock_guard<std::mutex> resynchronisingLock(resynchronisingMutex);
     {
-        // Everything unanswered goes again now, and is counted again.
+        // Everything unanswered goes again now, and is timed again.
         std::lock_guard<std::mutex> lock(mutex);
-        unanswered = 0;
-        unansweredSince.reset();
+        unanswered.clear();
     }
     resynchronising = true;
     try {
@@ -218,10 +224,9 @@ void MqttTransport::handleServerPayload(const std::vector<unsigned char>& payloa
     {
         std::lock_guard<std::mutex> lock(mutex);
         if (serverPayload.type == PayloadType::DELTA_LIST) {
-            answered(std::count_if(deltas.begin(), deltas.end(),
-                                   [this](const Delta& delta) { return clientIds.count(delta.clientId) != 0; }));
+            noteAnswers(deltas);
         } else {
-            answered(unanswered);  // a snapshot persists whatever of ours it holds
+            noteAnswers(snapshot);
         }
     }
     if (serverPayload.type == PayloadType::DELTA_LIST) {

@@ -38,12 +38,12 @@
 //
 // Unanswered changes: a broker in trouble (a NATS node dying) may lose what
 // it had acknowledged, the store's changes as well as the server's echoes
-// and its new token. So the transport counts the changes it publishes
-// against the echoes of this store's changes it receives; when some have
-// stayed unanswered for Options::resendUnansweredAfter, it resynchronises as
-// on a new server (subscriptions, then the queue) and waits twice as long
-// before the next such attempt, up to kMaxResendUnansweredAfter; once every
-// change is answered the wait is back to the option. A server that is merely
+// and its new token. So the transport keeps the changes it publishes until
+// their echoes arrive (UnansweredChanges); when one has stayed unanswered
+// for Options::resendUnansweredAfter, it resynchronises as on a new server
+// (subscriptions, then the queue) and waits twice as long before the next
+// such attempt, up to kMaxResendUnansweredAfter; once every change is
+// answered the wait is back to the option. A server that is merely
 // slow gets a resend it answers with echoes.
 //
 // Bad input: a server payload that does not parse, or is larger than
@@ -62,13 +62,13 @@
 #include <condition_variable>
 #include <map>
 #include <mutex>
-#include <optional>
 #include <set>
 #include <string>
 #include <thread>
 
 #include "tessarine/SyncProtocol.h"
 #include "tessarine/mqtt/MqttConnection.h"
+#include "tessarine/mqtt/UnansweredChanges.h"
 
 namespace lumivale {
 namespace tessarine {
@@ -111,10 +111,11 @@ private:
     void resynchronise();
     // The watch thread: resynchronises when changes stay unanswered.
     void watchForUnanswered();
-    // True, once, when changes have been unanswered long enough; mutex is held.
+    // True, once, when a change has been unanswered long enough; mutex is held.
     bool resendDue(std::chrono::steady_clock::time_point now);
-    // Counts answers (all when everything is answered, as by a snapshot).
-    void answered(size_t echoes);
+    // Takes the echoes among deltas, or what a snapshot holds; mutex is held.
+    void noteAnswers(const std::vector<Delta>& deltas);
+    void noteAnswers(const Snapshot& snapshot);
     void handleConnected();
     void handleDisconnected();
     void handleMessage(const std::string& topic, const std::vector<unsigned char>& payload, bool retained);
@@ -134,11 +135,8 @@ private:
     // resynchronised; meanwhile the application's changes wait in held.
     bool ready = false;
     std::vector<Delta> held;
-    // Changes published less own echoes received, and since when that has
-    // been above zero.
-    size_t unanswered = 0;
-    std::optional<std::chrono::steady_clock::time_point> unansweredSince;
-    std::chrono::milliseconds unansweredAllowed;
+    UnansweredChanges unanswered;
+    std::chrono::milliseconds unansweredAllowed;  // the wait before the next resend
     bool stopping = false;
     std::condition_variable stoppingWake;
 
