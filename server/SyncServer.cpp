@@ -36,7 +36,7 @@ SyncServer::SyncServer(std::unique_ptr<LogStorage> theStorage) : storage(std::mo
 SyncServer::SessionId SyncServer::attach(Delivery delivery) {
     std::lock_guard<std::mutex> lock(mutex);
     SessionId id = ++lastSessionId;
-    sessions.emplace(id, Session{std::move(delivery), {}});
+    sessions.emplace(id, Session{std::move(delivery), {}, {}});
     return id;
 }
 
@@ -75,11 +75,23 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
     SyncProtocol::Delta change = protocol::makeTessarineDelta(payload, 0);
     requireValidCollectionName(change.collectionName);
     if (change.clientId.empty()) throw std::runtime_error("change without a client id");
-    std::optional<SyncProtocol::Delta> earlier = storage->findAccepted(change);
-    std::optional<SyncProtocol::Delta> appended = earlier ? std::nullopt : storage->append(change);
+    if (session.lostChanges.count(change.collectionName) != 0) {
+        throw std::runtime_error("an earlier change of this session was not recorded; waiting for a subscription");
+    }
+    std::optional<SyncProtocol::Delta> earlier;
+    std::optional<SyncProtocol::Delta> appended;
+    try {
+        earlier = storage->findAccepted(change);
+        if (!earlier) appended = storage->append(change);
+        if (!appended && !earlier) earlier = storage->findAccepted(change);
+        if (!appended && !earlier) {
+            throw std::runtime_error("the storage refused the change as logged but does not hold it");
+        }
+    } catch (...) {
+        session.lostChanges.insert(change.collectionName);
+        throw;
+    }
     if (!appended) {
-        if (!earlier) earlier = storage->findAccepted(change);
-        if (!earlier) throw std::runtime_error("the storage refused the change as logged but does not hold it");
         // A session that follows the collection has been sent every change
         // up to the last one, so the echo carries that number: a client
         // moves its sequence number forward only, and never asks for (and
@@ -106,6 +118,9 @@ SyncServer::Receipt SyncServer::receiveSubscription(Session& session, const std:
     SyncProtocol::SubscriptionRequest request = parseSubscriptionRequest(payload);
     requireValidCollectionName(request.collectionName);
     const std::string& name = request.collectionName;
+    // The client sends everything it has not seen persisted again after
+    // this, oldest first.
+    session.lostChanges.erase(name);
     // A session that already follows the collection has been sent every
     // change: what the client does not hold yet is on its way. Sending it
     // again would make the client apply older changes over newer ones.

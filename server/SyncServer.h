@@ -42,7 +42,10 @@
 //     client id, or arrives on an unknown topic is dropped and logged at
 //     priority 5 under the tag "tessarine_server"; it changes nothing and
 //     reaches no one. So is a change the storage fails to record: nothing is
-//     echoed, and the client sends it again on its next connection.
+//     echoed, and the session's later changes to that collection are
+//     dropped too until its client subscribes to it again, so that none is
+//     logged ahead of the lost one; the client sends them all again, in
+//     order, after its next subscription.
 //   - A change is sent to anyone only once the storage has recorded it.
 //
 // Threads: every operation may be called from any thread; one mutex guards
@@ -119,6 +122,9 @@ private:
     struct Session {
         Delivery delivery;
         std::set<std::string> subscriptions;
+        // Collections of which a change was lost (the storage failed),
+        // until the next subscription to them.
+        std::set<std::string> lostChanges;
     };
 
     Receipt receiveChange(SessionId sessionId, Session& session, const std::vector<unsigned char>& payload);

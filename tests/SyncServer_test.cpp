@@ -282,6 +282,30 @@ TEST_P(SyncServerTest, DetachedSessionIsForgottenWithItsSubscriptions) {
     EXPECT_EQ(Outcome::DROPPED, gone.subscribe("B", 0).outcome);
 }
 
+// A change the storage failed to record must not be overtaken in the log by
+// the same session's later changes: they wait for the next subscription,
+// after which the client sends them all again, in order.
+TEST(SyncServerLostChangeTest, LaterChangesOfTheSessionWaitForTheNextSubscription) {
+    struct FailingOnce : ts::server::MemoryLogStorage {
+        std::optional<Delta> append(const Delta& delta) override {
+            if (std::exchange(failNext, false)) throw std::runtime_error("the disk is full");
+            return MemoryLogStorage::append(delta);
+        }
+        bool failNext = true;
+    };
+    SyncServer server(std::make_unique<FailingOnce>());
+    Client writer(server);
+    writer.subscribe("w", 0);
+    EXPECT_EQ(Outcome::DROPPED, writer.send(change("w", 1, "a")).outcome);
+    EXPECT_EQ(Outcome::DROPPED, writer.send(change("w", 2, "b")).outcome);
+    EXPECT_EQ(0u, server.sequenceNumber("app:notes"));
+    writer.subscribe("w", 0);
+    writer.take();
+    writer.send(change("w", 1, "a"));
+    writer.send(change("w", 2, "b"));
+    EXPECT_EQ((Lines{"list 1: w/1 a=1", "list 2: w/2 b=1"}), writer.take());
+}
+
 TEST(SqliteLogStorageTest, ReopenedFileServesOnWithItsLogAndRefusesAcceptedChangesAgain) {
     testsupport::TempDir dir;
     {
