@@ -168,6 +168,20 @@ protected:
         std::vector<std::string> last = query("SELECT last FROM tessarine_sequences");
         ASSERT_EQ(1u, last.size());
         EXPECT_EQ(last[0] + "|" + last[0] + "|" + last[0], numbers[0]);
+        // A store sends its changes oldest first, and a late copy of an
+        // older one must not be logged after a newer one.
+        std::map<std::string, int64_t> lastVersion;
+        for (const std::string& row :
+             query("SELECT client_id || '|' || version_id FROM tessarine_changes ORDER BY collection, sequence")) {
+            std::string client = row.substr(0, row.rfind('|'));
+            int64_t version = std::stoll(row.substr(row.rfind('|') + 1));
+            if (lastVersion[client] >= version) {
+                ADD_FAILURE() << client << " v" << version << " logged after v" << lastVersion[client] << ":\n"
+                              << logDump();
+                break;
+            }
+            lastVersion[client] = version;
+        }
         std::map<std::string, int> logged;
         for (const std::string& row : query("SELECT primary_key || ' ' || convert_from(blob, 'UTF8') FROM tessarine_changes")) {
             ++logged[row];
@@ -177,6 +191,15 @@ protected:
             EXPECT_FALSE(persisted.empty()) << tag;
             for (const std::string& line : persisted) EXPECT_EQ(1, logged[line]) << tag << " was told PERSISTED: " << line;
         }
+    }
+    std::string logDump() {
+        std::string text;
+        for (const std::string& row : query("SELECT sequence || ' ' || client_id || ' v' || version_id || ' ' || "
+                                            "primary_key || ' ' || convert_from(blob, 'UTF8') FROM tessarine_changes "
+                                            "ORDER BY collection, sequence")) {
+            text += row + "\n";
+        }
+        return text;
     }
     void stopDevices() {
         for (auto& device : devices) device->kill(SIGTERM);
@@ -207,7 +230,7 @@ TEST_F(ServerTierTest, StoresOnANatsClusterConvergeWhenTheServingInstanceIsKille
 }
 
 // The stores are on the other nodes: a store on a killed node is the
-// broker's and the transport's case (NetworkSync_test.cpp).
+// broker's and the transport's case (NetworkSync_test.cpp, and README).
 TEST_F(ServerTierTest, StoresOnANatsClusterConvergeWhenTheServingInstancesNodeIsKilledMidStream) {
     startBroker(true);
     startInstances({"one"});  // on node 0, and first, so that it serves
