@@ -73,7 +73,8 @@ public:
     // over. Sending resumes if a failure had stopped it. Call it on the
     // thread that reports the connection: it hands the resend and what waits
     // over on that thread (above), unless a caller further up its stack is
-    // sending, which then carries on with the resend. A resend that completes
+    // sending, which then carries on with the resend, or a report on another
+    // thread comes meanwhile, which then takes over. A resend that completes
     // logs how many deltas it handed over (priority 3). Throws what reading
     // the queue throws; then nothing is handed over until the next request.
     void resendOnConnection() TS_EXCLUDES(mutex);
