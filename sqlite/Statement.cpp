@@ -10,16 +10,40 @@ namespace sqlite {
 
 namespace {
 using Lock = ConnectionLock;
+
+// The column readers Column and RowReader share; the lock is the caller's.
+std::string_view textIn(sqlite3_stmt* s, int index) {
+    const unsigned char* text = sqlite3_column_text(s, index);
+    if (text == nullptr) return std::string_view();
+    return std::string_view(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(s, index)));
 }
+
+std::pair<const unsigned char*, std::size_t> blobIn(sqlite3_stmt* s, int index) {
+    const void* blob = sqlite3_column_blob(s, index);
+    std::size_t size = static_cast<std::size_t>(sqlite3_column_bytes(s, index));
+    return {static_cast<const unsigned char*>(blob), blob == nullptr ? 0 : size};
+}
+}  // namespace
 
 Statement::Statement(std::shared_ptr<Connection> theConnection, sqlite3_stmt* theStatement)
     : connection(std::move(theConnection)), statement(theStatement) {}
 
-Statement::ScopedLock::ScopedLock(const Statement& statement) : connection(*statement.connection) {
-    connection.mutex().lock();
+Statement::RowReader::RowReader(Statement& theStatement)
+    : statement(theStatement), handle(theStatement.checkedHandle("stepping")) {
+    statement.connection->mutex().lock();
 }
 
-Statement::ScopedLock::~ScopedLock() { connection.mutex().unlock(); }
+Statement::RowReader::~RowReader() { statement.connection->mutex().unlock(); }
+
+bool Statement::RowReader::step() { return statement.stepLocked(handle); }
+
+int Statement::RowReader::getInt(int column) const { return sqlite3_column_int(handle, column); }
+
+std::string_view Statement::RowReader::getTextView(int column) const { return textIn(handle, column); }
+
+std::pair<const unsigned char*, std::size_t> Statement::RowReader::getBlobDirectBuffer(int column) const {
+    return blobIn(handle, column);
+}
 
 Statement::Statement(Statement&& other) noexcept
     : connection(std::move(other.connection)), statement(other.statement), finished(other.finished) {
@@ -108,10 +132,14 @@ void Statement::bindBytes(int index, const unsigned char* data, unsigned int siz
 
 bool Statement::step() {
     sqlite3_stmt* s = checkedHandle("stepping");
+    Lock lock(connection->mutex());
+    return stepLocked(s);
+}
+
+bool Statement::stepLocked(sqlite3_stmt* s) {
     // SQLite would silently restart a finished statement; a reader that steps
     // past the end must keep seeing the end instead.
     if (finished) return false;
-    Lock lock(connection->mutex());
     int rc = sqlite3_step(s);
     if (rc == SQLITE_ROW) return true;
     if (rc == SQLITE_DONE) {
@@ -146,36 +174,25 @@ uint64_t Statement::Column::getUint64() const { return static_cast<uint64_t>(get
 std::string Statement::Column::getText() const {
     sqlite3_stmt* s = statement.checkedHandle("reading a column");
     Lock lock(statement.connection->mutex());
-    const unsigned char* text = sqlite3_column_text(s, index);
-    if (text == nullptr) return std::string();
-    return std::string(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(s, index)));
+    return std::string(textIn(s, index));
 }
 
 void Statement::Column::copyTextTo(std::string& target) const {
     sqlite3_stmt* s = statement.checkedHandle("reading a column");
     Lock lock(statement.connection->mutex());
-    const unsigned char* text = sqlite3_column_text(s, index);
-    if (text == nullptr) {
-        target.clear();
-    } else {
-        target.assign(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(s, index)));
-    }
+    target.assign(textIn(s, index));
 }
 
 std::string_view Statement::Column::getTextView() const {
     sqlite3_stmt* s = statement.checkedHandle("reading a column");
     Lock lock(statement.connection->mutex());
-    const unsigned char* text = sqlite3_column_text(s, index);
-    if (text == nullptr) return std::string_view();
-    return std::string_view(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(s, index)));
+    return textIn(s, index);
 }
 
 std::pair<const unsigned char*, std::size_t> Statement::Column::getBlobDirectBuffer() const {
     sqlite3_stmt* s = statement.checkedHandle("reading a column");
     Lock lock(statement.connection->mutex());
-    const void* blob = sqlite3_column_blob(s, index);
-    std::size_t size = static_cast<std::size_t>(sqlite3_column_bytes(s, index));
-    return {static_cast<const unsigned char*>(blob), blob == nullptr ? 0 : size};
+    return blobIn(s, index);
 }
 
 }  // namespace sqlite

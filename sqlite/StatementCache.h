@@ -15,9 +15,10 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <functional>
-#include <map>
+#include <memory>
 #include <string>
+#include <string_view>
+#include <unordered_map>
 #include <vector>
 
 struct sqlite3_stmt;
@@ -44,13 +45,17 @@ public:
 
 private:
     struct Entry {
+        std::string sql;
         std::vector<sqlite3_stmt*> idle;
         uint64_t lastUse = 0;
     };
 
     void evictLeastRecentlyUsed();
 
-    std::map<std::string, Entry, std::less<>> entries;
+    // Keyed by a view of the entry's own text, so that give looks SQLite's
+    // copy of the text up without building a string. SQL texts share long
+    // prefixes, which makes a hash cheaper than an ordered compare.
+    std::unordered_map<std::string_view, std::unique_ptr<Entry>> entries;
     std::size_t idleCount = 0;
     uint64_t useClock = 0;
 };

@@ -20,9 +20,9 @@ Cursor::Cursor(lumivale::sqlite::Statement&& theStatement, int thePrimaryKeyColu
 bool Cursor::step() noexcept {
     if (!statement) return false;
     try {
-        lumivale::sqlite::Statement::ScopedLock lock(*statement);
-        hasCurrentRow = statement->step();
-        if (hasCurrentRow) readRow();
+        lumivale::sqlite::Statement::RowReader reader(*statement);
+        hasCurrentRow = reader.step();
+        if (hasCurrentRow) readRow(reader);
     } catch (const std::exception& e) {
         hasCurrentRow = false;
         lv_printLog(LogPriority::kWarn, kStoreLogTag, "Cursor::step failed: %s", e.what());
@@ -30,11 +30,11 @@ bool Cursor::step() noexcept {
     return hasCurrentRow;
 }
 
-void Cursor::readRow() {
-    primaryKey = (*statement)(primaryKeyColumn).getTextView();
-    sortKey = (*statement)(sortKeyColumn).getTextView();
-    blob = (*statement)(blobColumn).getBlobDirectBuffer();
-    status = (*statement)(statusColumn).getInt();
+void Cursor::readRow(const lumivale::sqlite::Statement::RowReader& reader) {
+    primaryKey = reader.getTextView(primaryKeyColumn);
+    sortKey = reader.getTextView(sortKeyColumn);
+    blob = reader.getBlobDirectBuffer(blobColumn);
+    status = reader.getInt(statusColumn);
 }
 
 void Cursor::close() noexcept {

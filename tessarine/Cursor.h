@@ -52,8 +52,8 @@ public:
 
 private:
     void checkCurrentRow() const noexcept;
-    // Reads the current row's columns; the connection's lock is held.
-    void readRow();
+    // Reads the current row's columns under the reader's lock.
+    void readRow(const lumivale::sqlite::Statement::RowReader& reader);
 
     // Held in place rather than on the heap, so that the constructor cannot
     // fail; empty once the cursor is closed.

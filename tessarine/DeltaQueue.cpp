@@ -140,11 +140,10 @@ void DeltaQueue::processDeltaStatusUpdate(const SyncProtocol::Delta& delta, Sync
 void DeltaQueue::onConnectionEstablished() {
     if (stopped) return;
     try {
-        sender.requestResend();
+        sender.resendOnConnection();
     } catch (const std::exception& e) {
         lv_printLog(LogPriority::kError, kStoreLogTag, "Error in DeltaQueue::onConnectionEstablished: %s", e.what());
     }
-    sender.sendWaiting();
 }
 
 void DeltaQueue::onLifecycleStop() { stopped = true; }

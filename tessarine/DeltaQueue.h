@@ -9,7 +9,8 @@
 // transaction, addCommitted after its commit, sendCommitted outside every
 // lock; onDeltaStatusUpdated only posts a job; status jobs, and the
 // listeners they call after their commit, run on the worker;
-// onConnectionEstablished runs on the transport's thread. Listeners are
+// onConnectionEstablished runs on the transport's thread, which hands the
+// resend over itself before it returns (DeltaSender says why). Listeners are
 // added while the store is built, before any event can arrive: the list has
 // no lock. After the lifecycle stops, status and connection events are
 // ignored; the other operations still work.

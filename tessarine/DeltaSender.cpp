@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <exception>
 #include <optional>
+#include <thread>
 #include <utility>
 #include <vector>
 
@@ -53,7 +54,7 @@ void DeltaSender::addCommitted(int64_t queueId, SyncProtocol::Delta delta) noexc
     }
 }
 
-void DeltaSender::requestResend() {
+void DeltaSender::resendOnConnection() {
     // Read outside the lock: the queue may hold rows that were committed
     // before this sender was made, and a change committed after this read
     // has a greater id, so it is added as live and sent after the resend.
@@ -67,6 +68,18 @@ void DeltaSender::requestResend() {
         throw;
     }
     MutexLock lock(mutex);
+    if (sending && sender == std::this_thread::get_id()) {
+        startResend(storedUpToId);  // the sending loop up this thread's stack carries it
+        return;
+    }
+    ++waitingReports;
+    while (sending) senderStopped.wait(mutex);
+    --waitingReports;
+    startResend(storedUpToId);
+    sendAsSender();
+}
+
+void DeltaSender::startResend(int64_t storedUpToId) {
     ++resend.generation;
     resend.active = true;
     resend.upToId = std::max(storedUpToId, lastCommittedId);
@@ -77,27 +90,34 @@ void DeltaSender::requestResend() {
 }
 
 void DeltaSender::sendWaiting() noexcept {
-    Chunk chunk;
     MutexLock lock(mutex);
     if (sending) return;
+    sendAsSender();
+}
+
+void DeltaSender::sendAsSender() {
     sending = true;
+    sender = std::this_thread::get_id();
+    Chunk chunk;
     for (;;) {
         Next next = takeNext(chunk);
         if (next.kind == Next::Kind::NOTHING) return;
-        lock.unlock();
+        mutex.unlock();
         if (next.kind == Next::Kind::READ_CHUNK) {
             readChunk(chunk, next.generation);
         } else {
             send(next);
         }
-        lock.lock();
+        mutex.lock();
     }
 }
 
 DeltaSender::Next DeltaSender::takeNext(Chunk& chunk) {
     Next next;
     next.generation = resend.generation;
-    if (resend.active) {
+    if (waitingReports > 0) {
+        stopSending();  // the reporting thread goes on from here
+    } else if (resend.active) {
         if (chunk.generation != resend.generation || chunk.next == chunk.rows.size()) {
             next.kind = Next::Kind::READ_CHUNK;
         } else {
@@ -109,9 +129,15 @@ DeltaSender::Next DeltaSender::takeNext(Chunk& chunk) {
         next.live = std::move(live.front().delta);
         live.pop_front();
     } else {
-        sending = false;
+        stopSending();
     }
     return next;
+}
+
+void DeltaSender::stopSending() {
+    sending = false;
+    sender = std::thread::id();
+    senderStopped.notifyAll();
 }
 
 void DeltaSender::readChunk(Chunk& chunk, uint64_t generation) {

@@ -15,6 +15,16 @@
 // sending returns at once. So a transport may write through the store from
 // inside sendDelta: that write is sent after the change being sent now.
 //
+// A connection's resend is the exception: it goes out on the thread that
+// reports the connection, before resendOnConnection returns, after waiting
+// for the change another thread is handing over (if any). Transports hold
+// back what other threads send while they report a connection and publish
+// it afterwards; a change taken before the connection and handed over
+// during its report is held so, and reaches the server after the resend
+// instead of ahead of older changes of the same object that the last
+// connection lost. So sendDelta must not wait for the thread that reports
+// connections.
+//
 // A sendDelta that throws means the transport did not take the change. It
 // is logged (priority 5; priority 6 during a resend) and nothing more is
 // handed over until the next connection, whose resend carries every queued
@@ -24,13 +34,15 @@
 // Threads: every operation may be called from any thread. Locks: mutex is
 // the last in the store's lock order (README, "How a change flows through
 // the store"), held only to look at or change the waiting work, never while
-// the transport or the storage is called.
+// the transport or the storage is called; resendOnConnection waits on it
+// until the sending thread has stopped.
 #pragma once
 
 #include <cstdint>
 #include <deque>
 #include <memory>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "platform/ThreadAnnotations.h"
@@ -58,11 +70,14 @@ public:
 
     // A new connection: every change committed so far goes out again, oldest
     // first, before anything committed later; a resend under way starts
-    // over. Sending resumes if a failure had stopped it. A resend that
-    // completes logs how many deltas it handed over (priority 3). Throws what
-    // reading the queue throws; then nothing is handed over until the next
-    // request.
-    void requestResend() TS_EXCLUDES(mutex);
+    // over. Sending resumes if a failure had stopped it. Call it on the
+    // thread that reports the connection: it hands the resend and what waits
+    // over on that thread (above), unless a caller further up its stack is
+    // sending, which then carries on with the resend, or a report on another
+    // thread comes meanwhile, which then takes over. A resend that completes
+    // logs how many deltas it handed over (priority 3). Throws what reading
+    // the queue throws; then nothing is handed over until the next request.
+    void resendOnConnection() TS_EXCLUDES(mutex);
 
     // Hands over what waits, on the calling thread, unless somebody is
     // already doing so. Never throws.
@@ -95,9 +110,17 @@ private:
         SyncProtocol::Delta live;
     };
 
-    // Chooses the next step; mutex is held. Clears sending when there is
-    // nothing left, so that a change added later finds nobody sending.
+    // Sends until nothing waits or a connection's report wants to take over;
+    // mutex is held and nobody else is sending.
+    void sendAsSender() TS_REQUIRES(mutex);
+    // Chooses the next step; mutex is held. Stops sending when there is
+    // nothing left, so that a change added later finds nobody sending, or
+    // when a connection's report waits to take over.
     Next takeNext(Chunk& chunk) TS_REQUIRES(mutex);
+    void stopSending() TS_REQUIRES(mutex);
+    // Starts a resend of everything up to the greater of storedUpToId and
+    // the last committed id; mutex is held.
+    void startResend(int64_t storedUpToId) TS_REQUIRES(mutex);
     void readChunk(Chunk& chunk, uint64_t generation) TS_EXCLUDES(mutex);
     void send(const Next& next) TS_EXCLUDES(mutex);
     // Stops handing over until the next resend; mutex is held.
@@ -112,6 +135,9 @@ private:
     Resend resend TS_GUARDED_BY(mutex);
     int64_t lastCommittedId TS_GUARDED_BY(mutex) = 0;
     bool sending TS_GUARDED_BY(mutex) = false;    // a thread is handing over
+    std::thread::id sender TS_GUARDED_BY(mutex);  // which one
+    int waitingReports TS_GUARDED_BY(mutex) = 0;  // connection reports waiting to take over
+    CondVar senderStopped;
     bool suspended TS_GUARDED_BY(mutex) = false;  // a send failed; wait for the next connection
 };
 

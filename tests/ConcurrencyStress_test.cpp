@@ -215,6 +215,11 @@ TEST(ConcurrencyStressTest, WritersAndServerTrafficWithFaultsConvergeWithoutRace
             transport->setFaults(direction, {});
             other.transport->setFaults(direction, {});
         }
+        auto expectServerState = [&](const char* when) {
+            for (auto& [name, handle] : handles) {
+                EXPECT_EQ(testsupport::serverRows(*server, name), testsupport::objectRows(*handle)) << name << " " << when;
+            }
+        };
         bool settled = testsupport::waitUntil([&] {
             if (!transport->isConnected()) transport->connect();
             if (!other.transport->isConnected()) other.transport->connect();
@@ -223,6 +228,11 @@ TEST(ConcurrencyStressTest, WritersAndServerTrafficWithFaultsConvergeWithoutRace
             }
             return converged(other.collection(kShared), *server, kShared);
         }, std::chrono::seconds(120));
+        if (!settled) {
+            expectServerState("when the links had healed");
+            EXPECT_EQ(testsupport::serverRows(*server, kShared), testsupport::objectRows(other.collection(kShared)))
+                << "the other client";
+        }
         ASSERT_TRUE(settled);
 
         // The worker may still be working off deliveries that a reconnection
@@ -234,11 +244,6 @@ TEST(ConcurrencyStressTest, WritersAndServerTrafficWithFaultsConvergeWithoutRace
             ++markers;
             ASSERT_TRUE(other.collection(kShared).saveObject(kMarker, "m", Bytes{static_cast<unsigned char>(markers)}));
             ASSERT_TRUE(testsupport::waitUntil([&] { return callbacks.marker() == markers; }));
-        };
-        auto expectServerState = [&](const char* when) {
-            for (auto& [name, handle] : handles) {
-                EXPECT_EQ(testsupport::serverRows(*server, name), testsupport::objectRows(*handle)) << name << " " << when;
-            }
         };
         quiesce();
         expectServerState("at rest");

@@ -11,6 +11,8 @@
 #include <thread>
 #include <vector>
 
+#include <unistd.h>
+
 #include "FaultyVfs.h"
 #include "StoreTestSupport.h"
 #include "Watchdog.h"
@@ -205,6 +207,36 @@ TEST_F(LocalWriteTest, EachCollectionReachesTheTransportInVersionOrderWhileResen
         }
         EXPECT_EQ(kWriters * kWritesEach / 2, static_cast<int>(previous)) << collection;
     }
+}
+
+// Transports hold back what other threads send while they report a
+// connection, so the resend goes out on the reporting thread, once a change
+// another thread is handing over has gone: else that change could reach the
+// server ahead of older ones of its object that the last connection lost.
+TEST_F(LocalWriteTest, ConnectionReportedDuringAHandoverWaitsForItAndResendsOnTheReportingThread) {
+    std::atomic<pid_t> reporter{0};
+    std::atomic<bool> handing{false}, reported{false}, reportedDuringHandover{false};
+    std::atomic<int> sentByReporter{0};
+    s.transport->setOnSend([&](const ts::SyncProtocol::Delta&) {
+        if (::gettid() == reporter) {
+            ++sentByReporter;
+            return;
+        }
+        handing = true;
+        // Until the report has returned (wrong) or waits for this handover.
+        waitUntil([&] { return reported || (reporter != 0 && testsupport::isThreadAsleep(reporter)); });
+        reportedDuringHandover = reported.load();
+    });
+    testsupport::runWithWatchdog("a connection reported during a handover", std::chrono::seconds(60), [&] {
+        std::thread writer([&] { EXPECT_TRUE(items->saveObject("a", "s", Bytes{1})); });
+        ASSERT_TRUE(waitUntil([&] { return handing.load(); }));
+        reporter = ::gettid();
+        s.transport->onConnectionEstablished();
+        reported = true;
+        writer.join();
+    });
+    EXPECT_FALSE(reportedDuringHandover);
+    EXPECT_EQ(1, sentByReporter.load());
 }
 
 }  // namespace
