@@ -157,7 +157,7 @@ protected:
         }
         text += "server:";
         for (const std::string& row : serverRows()) text += " " + row;
-        return text;
+        return text + "\nlog:\n" + logDump();
     }
     // Numbers 1..n without gaps or repeats, the counter at n, and every
     // change a store was told PERSISTED logged exactly once.
