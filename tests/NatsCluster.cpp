@@ -125,8 +125,7 @@ NatsCluster::NatsCluster(const TempDir& dir) {
             separator = ", ";
         }
         out << " ]\n}\n"
-            << "mqtt {\n  listen: 127.0.0.1:" << nodes[i].mqttPort << "\n  stream_replicas: " << kNodes
-            << "\n  max_ack_pending: 1\n  ack_wait: \"5s\"\n}\n";
+            << "mqtt {\n  listen: 127.0.0.1:" << nodes[i].mqttPort << "\n  stream_replicas: " << kNodes << "\n}\n";
     }
 }
 
