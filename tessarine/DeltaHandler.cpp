@@ -1,6 +1,5 @@
 #include "tessarine/DeltaHandler.h"
 
-#include <algorithm>
 #include <exception>
 #include <stdexcept>
 
@@ -11,7 +10,6 @@
 #include "tessarine/Collection.h"
 #include "tessarine/Lifecycle.h"
 #include "tessarine/SerializedJobQueue.h"
-#include "tessarine/SnapshotConsumer.h"
 #include "tessarine/StoreLog.h"
 #include "tessarine/SubscriptionManager.h"
 #include "tessarine/VersionVectorStorage.h"
@@ -139,27 +137,17 @@ void DeltaHandler::onLifecycleStop() { stopped = true; }
 
 // Job on the worker: the whole delivery is one transaction, retried whole.
 void DeltaHandler::processDelivery(const std::vector<SyncProtocol::Delta>& deltas) {
-    std::vector<bool> taken;
     try {
         database->runInTransaction([&] {
-            taken.clear();
             DeliveryMarks marks;
-            for (const SyncProtocol::Delta& delta : deltas) taken.push_back(processIncomingDelta(delta, marks));
+            for (const SyncProtocol::Delta& delta : deltas) processIncomingDelta(delta, marks);
             storeDeliveryMarks(marks);
         }, kImmediate);
     } catch (const std::exception& e) {
         lv_printLog(LogPriority::kWarn, kStoreLogTag, "Failed to process received deltas: %s", e.what());
         throw;
     }
-    if (std::find(taken.begin(), taken.end(), false) == taken.end()) {
-        callDeltaCallbacks(deltas, SyncProtocol::DeltaStatus::PERSISTED);
-        return;
-    }
-    std::vector<SyncProtocol::Delta> reported;
-    for (size_t i = 0; i < deltas.size(); ++i) {
-        if (taken[i]) reported.push_back(deltas[i]);
-    }
-    callDeltaCallbacks(reported, SyncProtocol::DeltaStatus::PERSISTED);
+    callDeltaCallbacks(deltas, SyncProtocol::DeltaStatus::PERSISTED);
 }
 
 // Job on the worker, posted by the delta queue after it changed a row.
@@ -173,34 +161,13 @@ void DeltaHandler::processStatusUpdate(const SyncProtocol::Delta& delta, SyncPro
     callDeltaCallbacks({delta}, status);
 }
 
-bool DeltaHandler::processIncomingDelta(const SyncProtocol::Delta& delta, DeliveryMarks& marks) {
-    uint64_t applied = appliedBefore(delta.collectionName, marks);
-    bool fromSnapshot = delta.clientId == SnapshotConsumer::kClientId;
-    // Own echoes always count: an echo of a change logged earlier carries
-    // the collection's latest number, which may be one already applied.
-    if (!fromSnapshot && delta.clientId != clientId && applied > 0 && delta.sequenceNumber <= applied) {
-        lv_printLog(LogPriority::kDebug, kStoreLogTag, "Skipping a late copy of delta %llu of %s (applied up to %llu)",
-                    static_cast<unsigned long long>(delta.sequenceNumber), delta.collectionName.c_str(),
-                    static_cast<unsigned long long>(applied));
-        return false;
-    }
-    uint64_t& number = marks.sequenceNumbers.try_emplace(delta.collectionName, applied).first->second;
-    number = fromSnapshot ? delta.sequenceNumber : std::max(number, delta.sequenceNumber);
+void DeltaHandler::processIncomingDelta(const SyncProtocol::Delta& delta, DeliveryMarks& marks) {
+    marks.sequenceNumbers[delta.collectionName] = delta.sequenceNumber;
     if (delta.clientId == clientId) {
         processIncomingOwnDelta(delta);
     } else {
         processIncomingRemoteDelta(delta, marks);
     }
-    return true;
-}
-
-uint64_t DeltaHandler::appliedBefore(const std::string& collectionName, DeliveryMarks& marks) {
-    auto found = marks.appliedBefore.find(collectionName);
-    if (found != marks.appliedBefore.end()) return found->second;
-    // A collection never subscribed has applied nothing.
-    uint64_t applied = subscriptionManager->findSequenceNumber(collectionName).value_or(0);
-    marks.appliedBefore.emplace(collectionName, applied);
-    return applied;
 }
 
 void DeltaHandler::processIncomingOwnDelta(const SyncProtocol::Delta& delta) {

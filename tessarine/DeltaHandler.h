@@ -13,10 +13,7 @@
 // worker): a delivery becomes one job and one transaction; own deltas retire
 // their queue row and have their object's status recomputed, other clients'
 // deltas are applied as PERSISTED unless a local change of the object is
-// still queued. Another client's delta numbered at or below what the
-// collection has applied is a late copy (a broker delivers at least once,
-// and may deliver again long after) and is skipped, unreported; only a
-// snapshot moves a collection's number back. Status path (worker): when the queue reports a changed row,
+// still queued. Status path (worker): when the queue reports a changed row,
 // the object's status is recomputed and the application told.
 //
 // The application's callbacks run outside every transaction: on the writing
@@ -83,26 +80,19 @@ public:
     void onDeltaStatusUpdated(const SyncProtocol::Delta& delta, SyncProtocol::DeltaStatus status);
     void onLifecycleStop();
 
-    // What a delivery moves forward: per collection the highest sequence
-    // number (a snapshot's own, which may be lower), per (collection,
-    // writing client) the highest version id. Stored once each when the
-    // delivery's deltas have been applied, inside the same transaction,
-    // instead of once per delta. The views point into the delivery, which
-    // outlives the marks.
+    // What a delivery moves forward: per collection the sequence number of
+    // its last delta, per (collection, writing client) the highest version
+    // id. Stored once each when the delivery's deltas have been applied,
+    // inside the same transaction, instead of once per delta. The views
+    // point into the delivery, which outlives the marks.
     struct DeliveryMarks {
-        // Per collection the number stored before the delivery (0 for a
-        // collection never subscribed), read once per delivery.
-        std::map<std::string_view, uint64_t> appliedBefore;
         std::map<std::string_view, uint64_t> sequenceNumbers;
         std::map<std::pair<std::string_view, std::string_view>, uint64_t> highestVersions;
     };
 
     // One incoming delta, inside the caller's transaction; its sequence
-    // number and version go into marks. False for a late copy, skipped.
-    bool processIncomingDelta(const SyncProtocol::Delta& delta, DeliveryMarks& marks);
-    // The collection's number before the delivery; collectionName must
-    // point into the delivery.
-    uint64_t appliedBefore(const std::string& collectionName, DeliveryMarks& marks);
+    // number and version go into marks.
+    void processIncomingDelta(const SyncProtocol::Delta& delta, DeliveryMarks& marks);
     void processIncomingOwnDelta(const SyncProtocol::Delta& delta);
     void processIncomingRemoteDelta(const SyncProtocol::Delta& delta, DeliveryMarks& marks);
     void storeDeliveryMarks(const DeliveryMarks& marks);

@@ -30,7 +30,7 @@ void SnapshotConsumer::onSnapshotReceived(const SyncProtocol::Snapshot& snapshot
         deltas.reserve(snapshot.objects.size());
         for (const SyncProtocol::TessarineObject& object : snapshot.objects) {
             SyncProtocol::Delta delta;
-            delta.clientId = kClientId;
+            delta.clientId = snapshotClientId;
             delta.collectionName = collectionName;
             delta.versionId = 0;
             delta.primaryKey = object.primaryKey;

@@ -25,9 +25,6 @@ class SubscriptionManager;
 
 class SnapshotConsumer {
 public:
-    // The client id of the deltas a snapshot becomes.
-    static inline const std::string kClientId = "snapshot_store";
-
     SnapshotConsumer(std::shared_ptr<DeltaQueueStorage> deltaQueueStorage, std::shared_ptr<SyncProtocol> syncProtocol,
                      std::shared_ptr<SubscriptionManager> subscriptionManager);
     ~SnapshotConsumer();
@@ -43,6 +40,7 @@ private:
     std::shared_ptr<DeltaQueueStorage> deltaQueueStorage;
     std::shared_ptr<SyncProtocol> syncProtocol;
     std::shared_ptr<SubscriptionManager> subscriptionManager;
+    std::string snapshotClientId = "snapshot_store";
     int snapshotReceivedCallbackId = 0;
 };
 

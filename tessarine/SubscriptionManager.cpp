@@ -51,10 +51,6 @@ uint64_t SubscriptionManager::getSequenceNumber(const std::string& collectionNam
     return subscriptionStorage->getSequenceNumber(collectionName);
 }
 
-std::optional<uint64_t> SubscriptionManager::findSequenceNumber(const std::string& collectionName) {
-    return subscriptionStorage->findSequenceNumber(collectionName);
-}
-
 void SubscriptionManager::onConnectionEstablished() {
     lv_printLog(LogPriority::kDebug, kStoreLogTag, "SubscriptionManager::onConnectionEstablished is called back");
     try {

@@ -16,7 +16,6 @@
 
 #include <cstdint>
 #include <memory>
-#include <optional>
 #include <string>
 
 #include "tessarine/SyncProtocol.h"
@@ -47,8 +46,6 @@ public:
     virtual void sendSubscribeCollectionRequest(const std::string& collectionName, uint64_t sequenceNumber);
     virtual void updateSequenceNumber(const std::string& collectionName, uint64_t sequenceNumber);
     virtual uint64_t getSequenceNumber(const std::string& collectionName);
-    // Nothing for a collection never subscribed.
-    std::optional<uint64_t> findSequenceNumber(const std::string& collectionName);
 
     void onConnectionEstablished();
     void onSubscriptionResponseReceived(const SyncProtocol::SubscriptionResponse& response);

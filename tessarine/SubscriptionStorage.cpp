@@ -34,15 +34,9 @@ void SubscriptionStorage::deleteSubscription(const std::string& collectionName) 
 }
 
 uint64_t SubscriptionStorage::getSequenceNumber(const std::string& collectionName) {
-    std::optional<uint64_t> found = findSequenceNumber(collectionName);
-    if (!found) throw std::runtime_error("Failed to get sequence number for collection");
-    return *found;
-}
-
-std::optional<uint64_t> SubscriptionStorage::findSequenceNumber(const std::string& collectionName) {
     auto statement = database->prepare("SELECT seq_num FROM " + getTableName() + " WHERE collection_name = ?");
     statement.bind(1, collectionName);
-    if (!statement.step()) return std::nullopt;
+    if (!statement.step()) throw std::runtime_error("Failed to get sequence number for collection");
     return statement(0).getUint64();
 }
 

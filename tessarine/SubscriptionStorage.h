@@ -9,7 +9,6 @@
 
 #include <cstdint>
 #include <memory>
-#include <optional>
 #include <string>
 #include <vector>
 
@@ -37,8 +36,6 @@ public:
     virtual void addSubscription(const std::string& collectionName);
     virtual void deleteSubscription(const std::string& collectionName);
     virtual uint64_t getSequenceNumber(const std::string& collectionName);
-    // The stored number; nothing for a collection without a row.
-    virtual std::optional<uint64_t> findSequenceNumber(const std::string& collectionName);
     // Overwrites the stored number, larger or smaller; no row, no change.
     virtual void updateSequenceNumber(const std::string& collectionName, uint64_t sequenceNumber);
     // Every row, in the database's order.

@@ -112,29 +112,6 @@ TEST_F(DeltaHandlerTest, DeliveryOverSeveralCollectionsAndClientsStoresEachOnesL
     EXPECT_EQ(5u, versionVectorStorage->getCollectionVersion("a:b", "X"));
 }
 
-// A broker delivers at least once, and may deliver a copy long after the
-// original: applied again, it would undo every change since.
-TEST_F(DeltaHandlerTest, LateCopiesOfAppliedDeltasAreSkippedWhileOwnEchoesAndSnapshotsCount) {
-    deliver({remoteSave("a:b", "k", 10, {1})});
-    deliver({remoteSave("a:b", "k", 11, {2})});
-    size_t reported = receivedDeltas().size();
-    deliver({remoteSave("a:b", "k", 10, {1}), remoteSave("a:b", "k", 11, {1})});
-    EXPECT_EQ(std::make_pair(3, std::vector<unsigned char>{2}), object("a:b", "k"));
-    EXPECT_EQ(11u, subscriptionManager->getSequenceNumber("a:b"));
-    EXPECT_EQ(reported, receivedDeltas().size());
-
-    Delta own = localSave("a:b", "mine", {3});
-    deliver({echo(own, 11)});  // the echo of a change logged before carries the latest number
-    EXPECT_TRUE(deltaQueueStorage->getAllDeltas().empty());
-
-    Delta fromSnapshot = remoteSave("a:b", "k", 4, {5});  // a server that lost its log starts again
-    fromSnapshot.clientId = ts::SnapshotConsumer::kClientId;
-    deliver({fromSnapshot});
-    EXPECT_EQ(4u, subscriptionManager->getSequenceNumber("a:b"));
-    deliver({remoteSave("a:b", "k", 5, {6})});
-    EXPECT_EQ(std::make_pair(3, std::vector<unsigned char>{6}), object("a:b", "k"));
-}
-
 TEST_F(DeltaHandlerTest, OwnEchoRetiresQueueRowWithoutRewritingObject) {
     Delta first = localSave("a:b", "k", {1});
     Delta second = localSave("a:b", "k", {2});

@@ -156,6 +156,7 @@ void MqttTransport::handleDisconnected() {
     std::lock_guard<std::mutex> lock(mutex);
     ready = false;
     held.clear();
+    delivered.clear();
     unanswered.clear();
     unansweredAllowed = resendUnansweredAfter;
 }
@@ -224,6 +225,10 @@ void MqttTransport::handleServerPayload(const std::vector<unsigned char>& payloa
     {
         std::lock_guard<std::mutex> lock(mutex);
         if (serverPayload.type == PayloadType::DELTA_LIST) {
+            deltas.erase(std::remove_if(deltas.begin(), deltas.end(),
+                                        [this](const Delta& delta) { return !delivered.firstTime(delta); }),
+                         deltas.end());
+            if (deltas.empty()) return;  // copies only
             noteAnswers(deltas);
         } else {
             noteAnswers(snapshot);

@@ -46,6 +46,10 @@
 // answered the wait is back to the option. A server that is merely
 // slow gets a resend it answers with echoes.
 //
+// Copies: a delta the broker delivers again on the same connection (QoS 1
+// is at least once; a NATS node that died redelivers long after) is dropped
+// before it reaches the store (RecentDeliveries).
+//
 // Bad input: a server payload that does not parse, or is larger than
 // Options::maxPayloadBytes, is logged (priority 5, tag "tessarine") and
 // dropped; nothing reaches the store.
@@ -68,6 +72,7 @@
 
 #include "tessarine/SyncProtocol.h"
 #include "tessarine/mqtt/MqttConnection.h"
+#include "tessarine/mqtt/RecentDeliveries.h"
 #include "tessarine/mqtt/UnansweredChanges.h"
 
 namespace lumivale {
@@ -136,6 +141,7 @@ private:
     bool ready = false;
     std::vector<Delta> held;
     UnansweredChanges unanswered;
+    RecentDeliveries delivered;  // on this connection
     std::chrono::milliseconds unansweredAllowed;  // the wait before the next resend
     bool stopping = false;
     std::condition_variable stoppingWake;
