@@ -91,7 +91,7 @@ TEST_F(SnapshotTest, GeneratedSnapshotListsObjectsInSortOrderWithNumbers) {
     EXPECT_EQ(7u, snapshot.sequenceNumber);
     EXPECT_EQ(7u, snapshot.versionId);
     ASSERT_EQ(2u, snapshot.objects.size());
-    EXPECT_EQ("a", snapshot.objects[0].primaryKey);  // sort keys r-a < r-b
+    EXPECT_EQ("a", snapshot.objects[0].primaryKey);  // sort keys a < b
     EXPECT_EQ(std::vector<unsigned char>{1}, snapshot.objects[0].blob);
     EXPECT_EQ(0u, generator.generateSnapshot("a:b", "NOBODY").versionId);
 }
