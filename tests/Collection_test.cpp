@@ -1,7 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <thread>
-
 #include "StoreTestSupport.h"
 
 namespace {
@@ -66,38 +64,6 @@ TEST_F(CollectionTest, FailuresAreLoggedAndLeaveNoTrace) {
     EXPECT_TRUE(s.transport->sentDeltas().empty());  // nothing was queued
     EXPECT_TRUE(items->saveObject("k", "s", std::vector<unsigned char>{1}));
     EXPECT_EQ(2u, s.transport->sentDeltas().back().versionId);  // the failed write used up id 1
-}
-
-// Each write takes its version id in a transaction of its own before the
-// change is queued and sent. Writers on several threads must not overtake
-// one another between the two steps: the server would get a collection's
-// changes out of version order, and a snapshot that covers "everything up to
-// version v" could retire a lower change that it does not contain.
-TEST_F(CollectionTest, WritersOnSeveralThreadsHandChangesOverInVersionIdOrder) {
-    constexpr size_t kThreads = 4;
-    constexpr size_t kWrites = 250;
-    std::vector<std::thread> writers;
-    for (size_t t = 0; t < kThreads; ++t) {
-        writers.emplace_back([this, t] {
-            auto handle = s.store->subscribeCollection("app:items");
-            for (size_t i = 0; i < kWrites; ++i) {
-                EXPECT_TRUE(handle->saveObject(std::to_string(t) + "-" + std::to_string(i), "s",
-                                               std::vector<unsigned char>{1}));
-            }
-        });
-    }
-    for (std::thread& writer : writers) writer.join();
-    auto versionOrder = [](const std::vector<lumivale::tessarine::SyncProtocol::Delta>& deltas) {
-        for (size_t i = 0; i < deltas.size(); ++i) {
-            if (deltas[i].versionId != i + 1) return "version " + std::to_string(deltas[i].versionId) + " in place " + std::to_string(i + 1);
-        }
-        return std::string("in order");
-    };
-    ASSERT_EQ(kThreads * kWrites, s.transport->sentDeltas().size());
-    EXPECT_EQ("in order", versionOrder(s.transport->sentDeltas()));
-    s.transport->clearSent();
-    s.transport->onConnectionEstablished();
-    EXPECT_EQ("in order", versionOrder(s.transport->sentDeltas()));  // the queue keeps the same order
 }
 
 }  // namespace

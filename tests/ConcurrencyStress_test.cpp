@@ -1,7 +1,8 @@
 // Several application threads write into shared and separate collections of
 // one store while the reference server, over a faulty loopback link,
-// delivers echoes, status notices, another client's changes, reconnections
-// and snapshots. Built to run under ThreadSanitizer: a data race fails the
+// delivers echoes, status notices, another client's changes (that client
+// closed halfway with a change queued and reopened), reconnections and
+// snapshots. Built to run under ThreadSanitizer: a data race fails the
 // run, a deadlock trips the watchdog, and at the end everything must have
 // converged on the server's state.
 #include <gtest/gtest.h>
@@ -105,6 +106,11 @@ private:
     int lastMarker = 0;
 };
 
+void setFaults(LoopbackTransport& transport, const FaultRates& rates) {
+    transport.setFaults(LoopbackTransport::Direction::TO_SERVER, rates);
+    transport.setFaults(LoopbackTransport::Direction::TO_CLIENT, rates);
+}
+
 bool converged(ts::Collection& collection, const SyncServer& server, const std::string& name) {
     return testsupport::objectRows(collection) == testsupport::serverRows(server, name);
 }
@@ -133,10 +139,8 @@ TEST(ConcurrencyStressTest, WritersAndServerTrafficWithFaultsConvergeWithoutRace
         other.collection(kShared);
 
         const FaultRates faults{0.002, 0.03, 0.02, std::chrono::milliseconds(2)};
-        for (auto direction : {LoopbackTransport::Direction::TO_SERVER, LoopbackTransport::Direction::TO_CLIENT}) {
-            transport->setFaults(direction, faults);
-            other.transport->setFaults(direction, faults);
-        }
+        setFaults(*transport, faults);
+        setFaults(*other.transport, faults);
         store->start();
 
         std::atomic<int> writesDone{0};
@@ -168,11 +172,24 @@ TEST(ConcurrencyStressTest, WritersAndServerTrafficWithFaultsConvergeWithoutRace
                 }
             });
         }
+        // The other client's link is its own thread's to reconnect. Halfway,
+        // it writes offline and is closed with that change queued, then
+        // reopened on its file over a new link.
         threads.emplace_back([&] {
             std::mt19937 random(99);
             for (int i = 0; i < kWritesPerThread; ++i) {
-                EXPECT_TRUE(other.collection(kShared).saveObject("k" + std::to_string(random() % kKeys), "o",
-                                                                  Bytes{0xEE, static_cast<unsigned char>(i)}));
+                if (!other.transport->isConnected()) other.transport->connect();
+                if (i == kWritesPerThread / 2) {
+                    other.transport->disconnect();
+                    EXPECT_TRUE(other.collection(kShared).saveObject("offline", "o", Bytes{0xEF}));
+                    other.close();
+                    other.open(9);
+                    setFaults(*other.transport, faults);
+                }
+                std::string key = "k" + std::to_string(random() % kKeys);
+                EXPECT_TRUE(random() % 5 == 0 ? other.collection(kShared).deleteObject(key)
+                                              : other.collection(kShared).saveObject(
+                                                    key, "o", Bytes{0xEE, static_cast<unsigned char>(i)}));
             }
         });
         // The server side of the traffic that the faults do not make by
@@ -186,7 +203,6 @@ TEST(ConcurrencyStressTest, WritersAndServerTrafficWithFaultsConvergeWithoutRace
                 // A dropped message takes the link down; the application
                 // reconnects.
                 if (!transport->isConnected()) transport->connect();
-                if (!other.transport->isConnected()) other.transport->connect();
                 switch (random() % 16) {
                     case 0:
                         transport->disconnect();
@@ -211,10 +227,8 @@ TEST(ConcurrencyStressTest, WritersAndServerTrafficWithFaultsConvergeWithoutRace
 
         // Healthy links from now on: everything must settle on the server's
         // state, every object PERSISTED, nothing left queued.
-        for (auto direction : {LoopbackTransport::Direction::TO_SERVER, LoopbackTransport::Direction::TO_CLIENT}) {
-            transport->setFaults(direction, {});
-            other.transport->setFaults(direction, {});
-        }
+        setFaults(*transport, {});
+        setFaults(*other.transport, {});
         auto expectServerState = [&](const char* when) {
             for (auto& [name, handle] : handles) {
                 EXPECT_EQ(testsupport::serverRows(*server, name), testsupport::objectRows(*handle)) << name << " " << when;

@@ -38,26 +38,18 @@ constexpr int kCycles = 30;  // every process runs several times slower
 constexpr int kCycles = 60;
 #endif
 
-// A local change that the store must still hold in its queue.
-struct QueuedChange {
-    std::string collection;
-    std::string primaryKey;
-    ts::SyncProtocol::DeltaType type;
-    std::string sortKey;
-    std::vector<unsigned char> blob;
-    uint64_t versionId;
-};
+// A local change that the store must still hold in its queue, as the store
+// resends it (no client id, no sequence number).
+using QueuedChange = ts::SyncProtocol::Delta;
 
 QueuedChange changeOf(const JournalWrite& write, uint64_t versionId) {
-    QueuedChange change{write.collection, write.primaryKey,
-                        write.isSave ? ts::SyncProtocol::DeltaType::SAVE : ts::SyncProtocol::DeltaType::DELETE,
-                        write.sortKey, {}, versionId};
-    if (write.isSave) change.blob = testsupport::journalBlob(write.blobSeed, write.blobSize);
-    return change;
+    return {"", write.collection, versionId, write.primaryKey, write.sortKey,
+            write.isSave ? ts::SyncProtocol::DeltaType::SAVE : ts::SyncProtocol::DeltaType::DELETE,
+            write.isSave ? testsupport::journalBlob(write.blobSeed, write.blobSize) : std::vector<unsigned char>(), 0};
 }
 
 bool sameChange(const QueuedChange& expected, const ts::SyncProtocol::Delta& sent) {
-    return expected.collection == sent.collectionName && expected.primaryKey == sent.primaryKey &&
+    return expected.collectionName == sent.collectionName && expected.primaryKey == sent.primaryKey &&
            expected.type == sent.type && expected.sortKey == sent.sortKey && expected.blob == sent.blob;
 }
 
@@ -66,9 +58,9 @@ bool sameChange(const QueuedChange& expected, const ts::SyncProtocol::Delta& sen
 class ExpectedStore {
 public:
     void commit(const QueuedChange& change) {
-        highestVersionId[change.collection] = change.versionId;
+        highestVersionId[change.collectionName] = change.versionId;
         queue.push_back(change);
-        auto key = std::make_pair(change.collection, change.primaryKey);
+        auto key = std::make_pair(change.collectionName, change.primaryKey);
         if (change.type == ts::SyncProtocol::DeltaType::SAVE) {
             objects[key] = {change.sortKey, change.blob, 0};
         } else {
@@ -90,7 +82,7 @@ public:
             StoredObject shown = object;
             shown.status = 3;
             for (const QueuedChange& change : queue) {
-                if (change.collection == collection && change.primaryKey == key.second) shown.status = 1;
+                if (change.collectionName == collection && change.primaryKey == key.second) shown.status = 1;
             }
             result[key.second] = shown;
         }
@@ -114,16 +106,9 @@ protected:
     // Reopens the file after a kill and checks it against the journal; the
     // writes the store committed become part of `expected`.
     void verifyAfterKill(const Journal& journal, int cycle) {
-        // Declared before the store, whose worker calls into them.
-        std::vector<ts::Delta> heard;
-        std::mutex heardMutex;
         testsupport::StoreUnderTest s(path);
         ASSERT_TRUE(s.store) << "the file cannot be opened after the kill";
         s.store->setCollectionIndexerFunction(testsupport::journalIndexer);
-        s.store->addDeltaReceivedCallback([&](const std::vector<ts::Delta>& deltas) {
-            std::lock_guard<std::mutex> lock(heardMutex);
-            heard.insert(heard.end(), deltas.begin(), deltas.end());
-        });
         std::map<std::string, std::unique_ptr<ts::Collection>> handles;
         for (const char* name : {"crash:notes", "crash:tasks", "crash:remote"}) handles[name] = s.store->subscribeCollection(name);
         for (auto& handle : handles) ASSERT_TRUE(handle.second);
@@ -145,7 +130,7 @@ protected:
         // Every third cycle the server confirms everything, so that the
         // queue is sometimes carried across several kills and sometimes
         // starts empty.
-        if (cycle % 3 == 2) confirmQueue(s, clientId, heard, heardMutex, handles);
+        if (cycle % 3 == 2) confirmQueue(s, clientId, handles);
     }
 
     void checkResendAndCommit(const Journal& journal, const std::vector<ts::SyncProtocol::Delta>& resent,
@@ -178,7 +163,7 @@ protected:
             // answer was lost: it must be whole and carry a fresh id.
             QueuedChange committed = changeOf(*inFlight, resent.back().versionId);
             ASSERT_TRUE(sameChange(committed, resent.back())) << "the write in flight was resent damaged";
-            ASSERT_GT(committed.versionId, expected.highest(committed.collection));
+            ASSERT_GT(committed.versionId, expected.highest(committed.collectionName));
             expected.commit(committed);
         }
     }
@@ -220,30 +205,18 @@ protected:
 
     // Delivers the server's copy of every queued change and waits until it
     // has been applied; the queue is then empty.
-    void confirmQueue(testsupport::StoreUnderTest& s, const std::string& clientId, std::vector<ts::Delta>& heard,
-                      std::mutex& heardMutex, std::map<std::string, std::unique_ptr<ts::Collection>>& handles) {
+    void confirmQueue(testsupport::StoreUnderTest& s, const std::string& clientId,
+                      std::map<std::string, std::unique_ptr<ts::Collection>>& handles) {
         std::vector<ts::SyncProtocol::Delta> echoes;
         for (const QueuedChange& change : expected.queue) {
-            ts::SyncProtocol::Delta echo;
+            ts::SyncProtocol::Delta echo = change;
             echo.clientId = clientId;
-            echo.collectionName = change.collection;
-            echo.versionId = change.versionId;
-            echo.primaryKey = change.primaryKey;
-            echo.sortKey = change.sortKey;
-            echo.type = change.type;
-            echo.blob = change.blob;
             echo.sequenceNumber = 1;
             echoes.push_back(echo);
         }
-        {
-            std::lock_guard<std::mutex> lock(heardMutex);
-            heard.clear();
-        }
+        s.heard.clear();
         s.transport->onDeltaReceived(echoes);
-        ASSERT_TRUE(testsupport::waitUntil([&] {
-            std::lock_guard<std::mutex> lock(heardMutex);
-            return heard.size() == echoes.size();
-        }));
+        ASSERT_TRUE(testsupport::waitUntil([&] { return s.heard.size() == echoes.size(); }));
         expected.queue.clear();
         s.transport->clearSent();
         s.transport->onConnectionEstablished();

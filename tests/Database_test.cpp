@@ -142,39 +142,6 @@ TEST_F(DatabaseTest, ScopedLockLetsOwnCallsThroughAndHoldsOthersOff) {
     EXPECT_TRUE(has("mine"));
 }
 
-TEST_F(DatabaseTest, ConcurrentTransactionsAndOpenReadersAcrossThreadsStayConsistent) {
-    for (int i = 0; i < 50; ++i) insert("seed" + std::to_string(i));
-    constexpr int kThreads = 4;
-    constexpr int kRounds = 100;
-    std::vector<std::thread> threads;
-    std::atomic<int> readerRows{0};
-    for (int t = 0; t < kThreads; ++t) {
-        threads.emplace_back([&, t] {
-            for (int r = 0; r < kRounds; ++r) {
-                db->runInTransaction([&] {
-                    insert("t" + std::to_string(t) + "-" + std::to_string(r));
-                    if (r % 10 == 0) {
-                        db->runInTransaction([&] { insert("n" + std::to_string(t) + "-" + std::to_string(r)); },
-                                             kImmediate);
-                    }
-                }, kImmediate);
-            }
-        });
-    }
-    // A reader that keeps a statement open across the writers' commits, the
-    // way an application holds a cursor.
-    threads.emplace_back([&] {
-        Statement s = db->prepare("SELECT k FROM t WHERE k LIKE 'seed%' ORDER BY k");
-        while (s.step()) {
-            EXPECT_FALSE(s(0).getText().empty());
-            ++readerRows;
-        }
-    });
-    for (auto& thread : threads) thread.join();
-    EXPECT_EQ(50, readerRows.load());
-    EXPECT_EQ(50 + kThreads * kRounds + kThreads * (kRounds / 10), count());
-}
-
 TEST_F(DatabaseTest, StatementBindingsBlobsAndEndOfRows) {
     Statement insertBlob = db->prepare("INSERT INTO t (k, v) VALUES (?, ?)");
     insertBlob.bind(1, std::string("empty"));
@@ -320,21 +287,6 @@ TEST_F(StatementCacheTest, StatementInUseIsNeverHandedOutTwice) {
     Statement third = db->prepare(sql);
     Statement fourth = db->prepare(sql);
     EXPECT_EQ(before + 3, compiled());  // "SELECT 1" twice; both of sql's came back
-}
-
-TEST_F(StatementCacheTest, CachedStatementFollowsSchemaChanges) {
-    db->exec("CREATE TABLE u (a INTEGER)");
-    db->exec("INSERT INTO u VALUES (1)");
-    auto sum = [&] {
-        Statement s = db->prepare("SELECT total(a) FROM u");
-        s.step();
-        return s(0).getInt();
-    };
-    EXPECT_EQ(1, sum());
-    db->exec("DROP TABLE u");
-    db->exec("CREATE TABLE u (b TEXT, a INTEGER)");
-    db->exec("INSERT INTO u VALUES ('x', 7)");
-    EXPECT_EQ(7, sum());  // recompiled against the new table, not its old layout
 }
 
 TEST_F(StatementCacheTest, LeastRecentlyUsedTextsAreEvictedPastTheBound) {

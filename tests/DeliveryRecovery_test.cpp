@@ -11,38 +11,24 @@ namespace ts = lumivale::tessarine;
 using Direction = ts::CollectionStorage::SortDirection;
 using Status = ts::SyncProtocol::DeltaStatus;
 using testsupport::LogCapture;
+using testsupport::remoteDelta;
 using testsupport::rows;
 using testsupport::waitUntil;
 
 class DeliveryRecoveryTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        s.store->addDeltaReceivedCallback([this](const std::vector<ts::Delta>& deltas) {
-            std::lock_guard<std::mutex> lock(heardMutex);
-            for (const auto& d : deltas) {
-                heard.push_back(d.collectionName + "/" + d.primaryKey + ":" + std::to_string(d.blob.empty() ? 0 : d.blob[0]) +
-                                ":" + std::to_string(static_cast<int>(d.status)));
-            }
-        });
         known = s.store->subscribeCollection("app:known");
         ASSERT_TRUE(known);
     }
 
-    static ts::SyncProtocol::Delta remoteSave(const std::string& collection, const std::string& key, unsigned char value,
-                                              uint64_t sequenceNumber) {
-        ts::SyncProtocol::Delta delta;
-        delta.clientId = "ANOTHERCLIENT";
-        delta.collectionName = collection;
-        delta.versionId = sequenceNumber;
-        delta.primaryKey = key;
-        delta.sortKey = key;
-        delta.blob = {value};
-        delta.sequenceNumber = sequenceNumber;
-        return delta;
-    }
-
+    // What the application heard, as "collection/key:first blob byte:status", in order.
     std::vector<std::string> heardSoFar() {
-        std::lock_guard<std::mutex> lock(heardMutex);
+        std::vector<std::string> heard;
+        for (const ts::Delta& d : s.heard.all()) {
+            heard.push_back(d.collectionName + "/" + d.primaryKey + ":" + std::to_string(d.blob.empty() ? 0 : d.blob[0]) +
+                            ":" + std::to_string(static_cast<int>(d.status)));
+        }
         return heard;
     }
 
@@ -51,8 +37,6 @@ protected:
         ASSERT_TRUE(waitUntil([&] { return log.linesStartingWith("Failed to process received deltas: " + reason).size() >= 2; }));
     }
 
-    std::mutex heardMutex;
-    std::vector<std::string> heard;  // "collection/key:first blob byte:status", in order
     testsupport::TempDir dir;
     testsupport::StoreUnderTest s{dir.file("store.db")};
     std::unique_ptr<ts::Collection> known;
@@ -60,9 +44,9 @@ protected:
 
 TEST_F(DeliveryRecoveryTest, ChangeForUnsubscribedCollectionWaitsForSubscriptionThenEverythingAppliesInOrder) {
     LogCapture log;
-    s.transport->onDeltaReceived({remoteSave("app:later", "x", 1, 5)});  // no tables for app:later yet
-    s.transport->onDeltaReceived({remoteSave("app:known", "y", 1, 6)});
-    s.transport->onDeltaReceived({remoteSave("app:known", "y", 2, 7)});
+    s.transport->onDeltaReceived({remoteDelta("app:later", "x", 5, {1})});  // no tables for app:later yet
+    s.transport->onDeltaReceived({remoteDelta("app:known", "y", 6, {1})});
+    s.transport->onDeltaReceived({remoteDelta("app:known", "y", 7, {2})});
     // Local writes do not wait for the worker; their status notices do.
     ASSERT_TRUE(known->saveObject("z", "z", std::vector<unsigned char>{9}));
     ts::SyncProtocol::Delta sentZ = s.transport->sentDeltas().back();
@@ -117,8 +101,8 @@ TEST_F(DeliveryRecoveryTest, ChangeTheIndexerRejectsIsRetriedUntilTheIndexerIsFi
     };
     s.store->setCollectionIndexerFunction(indexer(false));
     LogCapture log;
-    s.transport->onDeltaReceived({remoteSave("app:known", "bad", 0xEE, 3)});
-    s.transport->onDeltaReceived({remoteSave("app:known", "good", 1, 4)});
+    s.transport->onDeltaReceived({remoteDelta("app:known", "bad", 3, {0xEE})});
+    s.transport->onDeltaReceived({remoteDelta("app:known", "good", 4, {1})});
     waitForRetries(log, "cannot index");
     EXPECT_TRUE(rows(known->query("", -1, Direction::ASCENDING)).empty());
 

@@ -77,22 +77,6 @@ TEST_F(DeltaQueueTest, StatusUpdatesChangeRowsOnWorkerAndReachListenersOnlyOnCha
     EXPECT_EQ(2u, heard().size());
 }
 
-TEST_F(DeltaQueueTest, PendingStatusIsTheLeastAdvancedQueuedStatus) {
-    EXPECT_EQ(ts::DeltaQueue::PendingStatus::PERSISTED, deltaQueue->getPendingStatus("a:b", "k"));
-    Delta older = localSave("a:b", "k");
-    Delta newer = localSave("a:b", "k");
-    deltaQueue->updateDeltaStatus(older, Status::SENT);
-    EXPECT_EQ(ts::DeltaQueue::PendingStatus::PENDING, deltaQueue->getPendingStatus("a:b", "k"));
-    deltaQueueStorage->removeDelta(newer);
-    EXPECT_EQ(ts::DeltaQueue::PendingStatus::SENT, deltaQueue->getPendingStatus("a:b", "k"));
-    EXPECT_EQ(ts::DeltaQueue::QUEUE_UNCHANGED, deltaQueue->updateDeltaStatus(older, Status::SENT));
-    EXPECT_EQ(ts::DeltaQueue::QUEUE_CHANGED, deltaQueue->updateDeltaStatus(older, Status::PENDING));
-
-    EXPECT_FALSE(deltaQueue->getMinStatus({}).has_value());
-    EXPECT_EQ(Status::PERSISTED, deltaQueue->getMinStatus({Status::PERSISTED}).value());
-    EXPECT_EQ(Status::SENT, deltaQueue->getMinStatus({Status::PERSISTED, Status::SENT, Status::SENT}).value());
-}
-
 TEST_F(DeltaQueueTest, ConnectionResendsWholeQueueOldestFirstUntilStopped) {
     LogCapture log;
     transport->onConnectionEstablished();

@@ -1,6 +1,6 @@
 // A transport for tests: records what the store sends, lets a test fire the
 // transport's events, and can be told to fail. Thread-safe. Also a
-// StdThreadCreator that counts the threads it starts.
+// StdThreadCreator that counts the threads it starts, and a remote change.
 #pragma once
 
 #include <atomic>
@@ -92,6 +92,13 @@ private:
     bool failSubscriptions = false;
     std::function<void(const Delta&)> onSend;
 };
+
+// Another client's save as the server delivers it: version id and sequence
+// number both n, the primary key as sort key.
+inline lumivale::tessarine::SyncProtocol::Delta remoteDelta(const std::string& collection, const std::string& key,
+                                                            uint64_t n, std::vector<unsigned char> blob = {9}) {
+    return {"OTHERCLIENT", collection, n, key, key, lumivale::tessarine::SyncProtocol::DeltaType::SAVE, std::move(blob), n};
+}
 
 class CountingThreadCreator : public StdThreadCreator {
 public:

@@ -73,18 +73,6 @@ protected:
         return versions;
     }
 
-    ts::SyncProtocol::Delta remoteSave(const std::string& key) {
-        ts::SyncProtocol::Delta delta;
-        delta.clientId = "OTHERCLIENT";
-        delta.collectionName = "app:items";
-        delta.versionId = 1;
-        delta.type = ts::SyncProtocol::DeltaType::SAVE;
-        delta.primaryKey = key;
-        delta.blob = {4};
-        delta.sequenceNumber = 1;
-        return delta;
-    }
-
     FaultyVfs vfs;  // first: the store opens its file through it
     testsupport::TempDir dir;
     testsupport::StoreUnderTest s{dir.file("store.db")};
@@ -108,7 +96,7 @@ TEST_F(LocalWriteTest, WritesFromTheTransportAndFromCallbacksWorkCompletelyAndKe
     withWriterAndWatchdog([&] {
         ASSERT_TRUE(items->saveObject("a", "s", Bytes{1}));
         ASSERT_TRUE(items->saveObject("b", "s", Bytes{1}));
-        s.transport->onDeltaReceived({remoteSave("remote")});
+        s.transport->onDeltaReceived({testsupport::remoteDelta("app:items", "remote", 1, {4})});
         ASSERT_TRUE(waitUntil([&] { return stored("from-worker"); }));
     });
     EXPECT_TRUE(fromSend && fromLocalCallback && fromWorkerCallback);
@@ -129,7 +117,7 @@ TEST_F(LocalWriteTest, WritesFromTheIndexerAreRefusedAtOnceOnLocalSavesAndDelive
     LogCapture log;
     withWriterAndWatchdog([&] {
         EXPECT_TRUE(items->saveObject("local", "s", Bytes{1}));
-        s.transport->onDeltaReceived({remoteSave("remote")});
+        s.transport->onDeltaReceived({testsupport::remoteDelta("app:items", "remote", 1, {4})});
         ASSERT_TRUE(waitUntil([&] { return stored("remote"); }));
     });
     EXPECT_EQ(2, refused.load());

@@ -72,18 +72,9 @@ protected:
         return delta;
     }
 
-    Delta remoteSave(const std::string& collection, const std::string& key, uint64_t sequenceNumber,
-                     std::vector<unsigned char> blob = {9}) {
-        Delta delta;
-        delta.clientId = "OTHERCLIENT";
-        delta.collectionName = collection;
-        delta.versionId = sequenceNumber;
-        delta.type = ts::SyncProtocol::DeltaType::SAVE;
-        delta.primaryKey = key;
-        delta.sortKey = "r-" + key;
-        delta.blob = std::move(blob);
-        delta.sequenceNumber = sequenceNumber;
-        return delta;
+    static Delta remoteSave(const std::string& collection, const std::string& key, uint64_t sequenceNumber,
+                            std::vector<unsigned char> blob = {9}) {
+        return remoteDelta(collection, key, sequenceNumber, std::move(blob));
     }
 
     // Status and blob of an object, or status 0 when it has no row.

@@ -127,13 +127,9 @@ TEST(StoreShutdownTest, DestroyingStoreThenLastHandleWhileTransportDeliversAndAp
                 own.versionId = static_cast<uint64_t>(i % 50 + 1);
                 transport->onDeltaStatusUpdated(
                     {own, i % 3 ? ts::SyncProtocol::DeltaStatus::SENT : ts::SyncProtocol::DeltaStatus::PERSISTED});
-                ts::SyncProtocol::Delta remote;
-                remote.clientId = "ANOTHERCLIENT";
-                remote.collectionName = "app:remote";
-                remote.primaryKey = "remote-" + std::to_string(i % 10);
-                remote.blob = {static_cast<unsigned char>(i)};
-                remote.sequenceNumber = static_cast<uint64_t>(i);
-                transport->onDeltaReceived({remote});
+                transport->onDeltaReceived({testsupport::remoteDelta(
+                    "app:remote", "remote-" + std::to_string(i % 10), static_cast<uint64_t>(i),
+                    {static_cast<unsigned char>(i)})});
                 progress.waitFor("remote", i);
             }
         });

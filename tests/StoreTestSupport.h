@@ -5,6 +5,7 @@
 
 #include <map>
 #include <memory>
+#include <mutex>
 #include <ostream>
 #include <string>
 #include <vector>
@@ -17,12 +18,41 @@
 
 namespace testsupport {
 
+// Every change a store reports to the application, in order; thread-safe.
+class HeardDeltas {
+public:
+    void listenTo(lumivale::tessarine::Tessarine& store) {
+        store.addDeltaReceivedCallback([this](const std::vector<lumivale::tessarine::Delta>& deltas) {
+            std::lock_guard<std::mutex> lock(mutex);
+            heard.insert(heard.end(), deltas.begin(), deltas.end());
+        });
+    }
+    std::vector<lumivale::tessarine::Delta> all() const {
+        std::lock_guard<std::mutex> lock(mutex);
+        return heard;
+    }
+    size_t size() const { return all().size(); }
+    void clear() {
+        std::lock_guard<std::mutex> lock(mutex);
+        heard.clear();
+    }
+
+private:
+    mutable std::mutex mutex;
+    std::vector<lumivale::tessarine::Delta> heard;
+};
+
+// The store listens to heard from the start; heard outlives the store, whose
+// worker reports to it.
 struct StoreUnderTest {
     explicit StoreUnderTest(const std::string& path)
-        : store(lumivale::tessarine::Tessarine::open(path, transport, threadCreator)) {}
+        : store(lumivale::tessarine::Tessarine::open(path, transport, threadCreator)) {
+        if (store) heard.listenTo(*store);
+    }
 
     std::shared_ptr<FakeTransport> transport = std::make_shared<FakeTransport>();
     std::shared_ptr<CountingThreadCreator> threadCreator = std::make_shared<CountingThreadCreator>();
+    HeardDeltas heard;
     std::unique_ptr<lumivale::tessarine::Tessarine> store;
 };
 

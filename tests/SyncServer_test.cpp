@@ -20,14 +20,7 @@ using Outcome = SyncServer::Outcome;
 
 Delta change(const std::string& clientId, uint64_t versionId, const std::string& key, const std::string& sortKey = "s",
              std::vector<unsigned char> blob = {1}, const std::string& collection = "app:notes") {
-    Delta delta;
-    delta.clientId = clientId;
-    delta.collectionName = collection;
-    delta.versionId = versionId;
-    delta.primaryKey = key;
-    delta.sortKey = sortKey;
-    delta.blob = std::move(blob);
-    return delta;
+    return {clientId, collection, versionId, key, sortKey, ts::SyncProtocol::DeltaType::SAVE, std::move(blob), 0};
 }
 
 Delta deletion(const std::string& clientId, uint64_t versionId, const std::string& key) {
