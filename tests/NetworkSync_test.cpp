@@ -466,8 +466,9 @@ TEST_F(EmbeddedSyncTest, UnansweredChangeIsResentAfterSubscribingAgainAndRepeate
 
     auto options = brokerOptions("device", "s3cret");
     options.resendUnansweredAfter = std::chrono::milliseconds(50);
-    Store store = openStore(options, "store");
+    // Before the store: its worker reports into it until the store is gone.
     std::map<unsigned char, int> reported;  // blob of "other" -> times the store reported it
+    Store store = openStore(options, "store");
     store.store->addDeltaReceivedCallback([&](const std::vector<ts::Delta>& deltas) {
         std::lock_guard<std::mutex> lock(mutex);
         for (const ts::Delta& delta : deltas) {
