@@ -61,11 +61,19 @@ void CollectionLeases::stop() {
     release();
 }
 
-uint64_t CollectionLeases::epoch(const std::string& collection) const {
+uint64_t CollectionLeases::epoch(const std::string& collection) {
     std::lock_guard<std::mutex> lock(mutex);
     auto found = held.find(collection);
-    if (found == held.end() || std::chrono::steady_clock::now() >= found->second.validUntil) return 0;
-    return found->second.epoch;
+    if (found == held.end()) return 0;
+    if (std::chrono::steady_clock::now() < found->second.validUntil) return found->second.epoch;
+    // Lapsed before its renewal came back (the database slow, say). What is
+    // refused from now on reaches no instance, so whatever serves the
+    // collection next, this instance included, must start afresh: a renewal
+    // still under way makes it a new lease.
+    lv_printLog(LogPriority::kInfo, kServerLogTag, "CollectionLeases: %s no longer serves \"%s\": not renewed in time",
+                instanceId.c_str(), collection.c_str());
+    held.erase(found);
+    return 0;
 }
 
 void CollectionLeases::noticed(const std::string& collection) {

@@ -23,7 +23,11 @@
 // Locally a lease counts as held until renewPeriod before it expires (its
 // expiry is measured from before the renewal was sent, so the local clock
 // errs on the early side); the storage's append checks the lease in the
-// database as well, so an instance that lost it cannot log anything.
+// database as well, so an instance that lost it cannot log anything. A lease
+// that epoch() finds lapsed is given up there and then, even if a renewal is
+// under way: the requests refused meanwhile reached no instance, so when the
+// renewal comes back the lease counts as new (a new epoch), never as the
+// old one continued.
 //
 // epoch() and noticed() behave as CollectionOwnership says; an epoch is new
 // for every acquisition of a lease.
@@ -83,7 +87,7 @@ public:
     void start() override;
     void stop() override;
 
-    uint64_t epoch(const std::string& collection) const override;
+    uint64_t epoch(const std::string& collection) override;
     void noticed(const std::string& collection) override;
 
 private:

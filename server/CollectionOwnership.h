@@ -28,7 +28,7 @@ public:
     // Gives up what it owns; epoch() is 0 for everything afterwards.
     virtual void stop() = 0;
 
-    virtual uint64_t epoch(const std::string& collection) const = 0;
+    virtual uint64_t epoch(const std::string& collection) = 0;
     virtual void noticed(const std::string& collection) = 0;
 };
 
