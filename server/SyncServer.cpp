@@ -36,7 +36,7 @@ SyncServer::SyncServer(std::unique_ptr<LogStorage> theStorage) : storage(std::mo
 SyncServer::SessionId SyncServer::attach(Delivery delivery) {
     std::lock_guard<std::mutex> lock(mutex);
     SessionId id = ++lastSessionId;
-    sessions.emplace(id, Session{std::move(delivery), {}, {}});
+    sessions.emplace(id, Session{std::move(delivery), {}, {}, {}});
     return id;
 }
 
@@ -80,8 +80,10 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
     }
     std::optional<SyncProtocol::Delta> earlier;
     std::optional<SyncProtocol::Delta> appended;
+    uint64_t& lastTaken = session.lastTaken[change.collectionName];
     try {
         earlier = storage->findAccepted(change);
+        if (!earlier) requireFollowsLastTaken(protocol::previousVersionIdOf(payload), lastTaken);
         if (!earlier) appended = storage->append(change);
         if (!appended && !earlier) earlier = storage->findAccepted(change);
         if (!appended && !earlier) {
@@ -91,6 +93,7 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
         session.lostChanges.insert(change.collectionName);
         throw;
     }
+    lastTaken = std::max(lastTaken, change.versionId);
     if (!appended) {
         // A session that follows the collection has been sent every change
         // up to the last one, so the echo carries that number: a client
@@ -112,6 +115,16 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
                 static_cast<unsigned long long>(change.versionId),
                 static_cast<unsigned long long>(logged.sequenceNumber));
     return receipt(Outcome::CHANGE_ACCEPTED, change.collectionName);
+}
+
+// A change that names the one its client sent before it (in this
+// collection, since subscribing) comes only after that one: when the broker
+// lost the other, taking this one would log them out of order. The client
+// sends both again after its next subscription.
+void SyncServer::requireFollowsLastTaken(uint64_t previousVersionId, uint64_t lastTaken) {
+    if (previousVersionId == 0 || previousVersionId == lastTaken) return;
+    throw std::runtime_error("the change sent before it (version " + std::to_string(previousVersionId) +
+                             ") never arrived; waiting for a subscription");
 }
 
 SyncServer::Receipt SyncServer::receiveSubscription(Session& session, const std::vector<unsigned char>& payload) {

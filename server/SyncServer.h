@@ -45,7 +45,10 @@
 //     echoed, and the session's later changes to that collection are
 //     dropped too until its client subscribes to it again, so that none is
 //     logged ahead of the lost one; the client sends them all again, in
-//     order, after its next subscription.
+//     order, after its next subscription. The same holds for a change
+//     that names a previous one (the client's previousVersionId, which the
+//     MQTT transport sends) this session has not accepted or echoed: the
+//     broker lost that one on the way.
 //   - A change is sent to anyone only once the storage has recorded it.
 //
 // Threads: every operation may be called from any thread; one mutex guards
@@ -122,12 +125,16 @@ private:
     struct Session {
         Delivery delivery;
         std::set<std::string> subscriptions;
-        // Collections of which a change was lost (the storage failed),
-        // until the next subscription to them.
+        // Collections of which a change was lost (the storage failed, or
+        // the broker), until the next subscription to them.
         std::set<std::string> lostChanges;
+        // Per collection, the highest version id of the session's client
+        // accepted or echoed on this session.
+        std::map<std::string, uint64_t> lastTaken;
     };
 
     Receipt receiveChange(SessionId sessionId, Session& session, const std::vector<unsigned char>& payload);
+    static void requireFollowsLastTaken(uint64_t previousVersionId, uint64_t lastTaken);
     Receipt receiveSubscription(Session& session, const std::vector<unsigned char>& payload);
     Receipt receiveSnapshotRequest(Session& session, const std::vector<unsigned char>& payload);
     std::vector<SyncProtocol::Delta> catchUpAfter(const std::string& collectionName, uint64_t sequenceNumber,

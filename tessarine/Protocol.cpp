@@ -109,6 +109,12 @@ SyncProtocol::Delta makeTessarineDelta(const std::vector<unsigned char>& buffer,
     return makeTessarineDelta(*serverDelta, sequenceNumber);
 }
 
+uint64_t previousVersionIdOf(const std::vector<unsigned char>& buffer) {
+    const auto* serverDelta = verifiedRoot<wire::ServerDelta>(buffer);
+    if (serverDelta == nullptr) rejectServerDelta();
+    return serverDelta->previousVersionId();
+}
+
 SyncProtocol::ServerPayload deserializeServerPayload(std::vector<unsigned char> bytes) {
     const char* logLine = "Error deserializing ServerPayload: invalid";
     const char* message = "Invalid ServerPayload flatbuffer.";
@@ -171,6 +177,10 @@ std::vector<unsigned char> makePayloadForSubscription(const SyncProtocol::Subscr
 }
 
 std::vector<unsigned char> makePayloadForSendDelta(const SyncProtocol::Delta& delta) {
+    return makePayloadForSendDelta(delta, 0);
+}
+
+std::vector<unsigned char> makePayloadForSendDelta(const SyncProtocol::Delta& delta, uint64_t previousVersionId) {
     const wire::ChangeType type = convertDeltaType(delta.type);
     flatbuffers::FlatBufferBuilder builder(kInitialBuilderSize);
 
@@ -195,6 +205,7 @@ std::vector<unsigned char> makePayloadForSendDelta(const SyncProtocol::Delta& de
     table.add_versionVector(versionVector);
     table.add_blob(blob);
     table.add_clientId(clientId);
+    table.add_previousVersionId(previousVersionId);
     builder.Finish(table.Finish());
     return finishedBytes(builder);
 }

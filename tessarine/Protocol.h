@@ -116,6 +116,13 @@ std::vector<unsigned char> makePayloadForSubscription(const SyncProtocol::Subscr
 // the sequence number. Throws "Invalid SyncProtocol::DeltaType" for a type
 // other than SAVE or DELETE.
 std::vector<unsigned char> makePayloadForSendDelta(const SyncProtocol::Delta& delta);
+// The same, naming the version id of the change the transport sent just
+// before this one in the same collection (previousVersionId in the schema;
+// not written when 0), so that a server can tell that one was lost.
+std::vector<unsigned char> makePayloadForSendDelta(const SyncProtocol::Delta& delta, uint64_t previousVersionId);
+// The previousVersionId of a ServerDelta buffer; 0 when it has none. Throws
+// as makeTessarineDelta does for a buffer that is not valid.
+uint64_t previousVersionIdOf(const std::vector<unsigned char>& buffer);
 
 // A SnapshotRequest buffer asking for a snapshot of collectionName on behalf
 // of clientId.

@@ -432,7 +432,7 @@ TEST_F(EmbeddedSyncTest, HostilePayloadsOnEveryTopicAreDroppedAndServingGoesOn) 
 TEST_F(EmbeddedSyncTest, UnansweredChangeIsResentAfterSubscribingAgainAndRepeatedDeliveriesAreDropped) {
     broker.start();
     std::mutex mutex;
-    std::vector<std::string> heard;  // topics, and "change <version>" for changes
+    std::vector<std::string> heard;  // topics, and "change <version> after <previous>" for changes
     uint64_t forwarded = 0;
     std::vector<unsigned char> firstForward;
     // For each change: another client's change numbered one more, then again
@@ -449,7 +449,8 @@ TEST_F(EmbeddedSyncTest, UnansweredChangeIsResentAfterSubscribingAgainAndRepeate
                     return;
                 }
                 ts::SyncProtocol::Delta change = ts::protocol::makeTessarineDelta(payload, 0);
-                heard.push_back("change " + std::to_string(change.versionId));
+                heard.push_back("change " + std::to_string(change.versionId) + " after " +
+                                std::to_string(ts::protocol::previousVersionIdOf(payload)));
                 ts::SyncProtocol::Delta other = change;
                 other.clientId = "other";
                 other.primaryKey = "other";
@@ -476,16 +477,19 @@ TEST_F(EmbeddedSyncTest, UnansweredChangeIsResentAfterSubscribingAgainAndRepeate
         }
     });
     store.notes->saveObject("k", "k", {1});
+    store.notes->saveObject("j", "j", {2});
     std::vector<std::string> seen;
     ASSERT_TRUE(waitUntil([&] {
         std::lock_guard<std::mutex> lock(mutex);
         seen = heard;
-        return std::count(seen.begin(), seen.end(), "change 1") >= 4;
+        return std::count(seen.begin(), seen.end(), "change 2 after 1") >= 4;
     }));
     // At most two copies go out at the start (a write racing the first
-    // connection's resend); the last one is a resend of an unanswered change.
-    auto last = std::find(seen.rbegin(), seen.rend(), "change 1");
-    EXPECT_EQ(ts::protocol::TOPIC_SUBSCRIBE_COLLECTION, *(last + 1));
+    // connection's resend); the last ones are a resend of unanswered changes,
+    // each naming the one sent before it since the subscription.
+    auto last = std::find(seen.rbegin(), seen.rend(), "change 2 after 1");
+    EXPECT_EQ("change 1 after 0", *(last + 1));
+    EXPECT_EQ(ts::protocol::TOPIC_SUBSCRIBE_COLLECTION, *(last + 2));
     // The third forward comes after the first one's copy.
     ASSERT_TRUE(waitUntil([&] {
         std::lock_guard<std::mutex> lock(mutex);

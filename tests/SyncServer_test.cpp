@@ -36,8 +36,9 @@ struct Client {
         id = theServer.attach([this](std::vector<unsigned char> payload) { payloads.push_back(std::move(payload)); });
     }
 
-    SyncServer::Receipt send(const Delta& delta) {
-        return server.receive(id, protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta));
+    // previous: the version id the change names as sent before it.
+    SyncServer::Receipt send(const Delta& delta, uint64_t previous = 0) {
+        return server.receive(id, protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta, previous));
     }
     SyncServer::Receipt subscribe(const std::string& clientId, uint64_t sequenceNumber,
                                   const std::string& collection = "app:notes") {
@@ -275,9 +276,10 @@ TEST_P(SyncServerTest, DetachedSessionIsForgottenWithItsSubscriptions) {
     EXPECT_EQ(Outcome::DROPPED, gone.subscribe("B", 0).outcome);
 }
 
-// A change the storage failed to record must not be overtaken in the log by
-// the same session's later changes: they wait for the next subscription,
-// after which the client sends them all again, in order.
+// A change the storage failed to record, or the broker lost, must not be
+// overtaken in the log by the same session's later changes: they wait for
+// the next subscription, after which the client sends them all again, in
+// order.
 TEST(SyncServerLostChangeTest, LaterChangesOfTheSessionWaitForTheNextSubscription) {
     struct FailingOnce : ts::server::MemoryLogStorage {
         std::optional<Delta> append(const Delta& delta) override {
@@ -297,6 +299,17 @@ TEST(SyncServerLostChangeTest, LaterChangesOfTheSessionWaitForTheNextSubscriptio
     writer.send(change("w", 1, "a"));
     writer.send(change("w", 2, "b"));
     EXPECT_EQ((Lines{"list 1: w/1 a=1", "list 2: w/2 b=1"}), writer.take());
+
+    // The broker lost version 3, which 4 names as sent before it.
+    EXPECT_EQ(Outcome::DROPPED, writer.send(change("w", 4, "d"), 3).outcome);
+    EXPECT_EQ(Outcome::DROPPED, writer.send(change("w", 5, "e"), 4).outcome);
+    // A new connection: the client resends what it has not seen persisted.
+    Client resending(server);
+    resending.subscribe("w", 2);
+    resending.send(change("w", 2, "b"));  // an echo counts as taken
+    resending.send(change("w", 3, "c"), 2);
+    resending.send(change("w", 4, "d"), 3);
+    EXPECT_EQ((Lines{"list 2: w/2 b=1", "list 3: w/3 c=1", "list 4: w/4 d=1"}), resending.take());
 }
 
 TEST(SqliteLogStorageTest, ReopenedFileServesOnWithItsLogAndRefusesAcceptedChangesAgain) {

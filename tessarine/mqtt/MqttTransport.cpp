@@ -123,7 +123,12 @@ int MqttTransport::sendDelta(const Delta& delta) {
 int MqttTransport::publishChange(const Delta& delta) {
     // Called with the lock held, so that the acknowledgement, which can come
     // back before publish returns, finds the change.
-    int messageId = connection.publish(protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta));
+    // The chain names what was tried, sent or not: a change after one that
+    // did not go out must not be taken before it.
+    uint64_t& previous = lastPublished[{delta.clientId, delta.collectionName}];
+    int messageId =
+        connection.publish(protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta, previous));
+    previous = delta.versionId;
     if (messageId == 0) return 0;
     unacknowledged[messageId] = delta;
     unanswered.published(delta.collectionName, delta.versionId, std::chrono::steady_clock::now());
@@ -164,9 +169,12 @@ void MqttTransport::handleDisconnected() {
 void MqttTransport::resynchronise() {
     std::lock_guard<std::mutex> resynchronisingLock(resynchronisingMutex);
     {
-        // Everything unanswered goes again now, and is timed again.
+        // Everything unanswered goes again now, and is timed again; the
+        // first change of each collection after the subscription names none
+        // before it.
         std::lock_guard<std::mutex> lock(mutex);
         unanswered.clear();
+        lastPublished.clear();
     }
     resynchronising = true;
     try {

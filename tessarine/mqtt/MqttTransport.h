@@ -27,7 +27,13 @@
 // runs before any other change goes out on a new connection or to a new
 // server: changes the application sends meanwhile are held and published
 // right after it, in order. The server, for its part, takes a client's
-// changes only after that client's subscription (NetworkSyncServer).
+// changes only after that client's subscription (NetworkSyncServer). And
+// each change names the one published before it in its collection since
+// the resynchronisation (previousVersionId on the wire): a broker that loses
+// a change yet delivers later ones (a NATS node, acknowledging them all)
+// cannot make the server log them first, as it refuses a change whose
+// previous one it did not take, and everything after it, until the client
+// subscribes again (see Unanswered changes).
 //
 // Statuses: sendDelta returns 1 when the change went (or, held, goes) to
 // the broker and 0 when it did not (offline); either way the store keeps the
@@ -69,6 +75,7 @@
 #include <set>
 #include <string>
 #include <thread>
+#include <utility>
 
 #include "tessarine/SyncProtocol.h"
 #include "tessarine/mqtt/MqttConnection.h"
@@ -141,6 +148,10 @@ private:
     bool ready = false;
     std::vector<Delta> held;
     UnansweredChanges unanswered;
+    // By (client id, collection): the version id of the last change published
+    // since the last resynchronisation, which the next one names as its
+    // previous (see Order, above).
+    std::map<std::pair<std::string, std::string>, uint64_t> lastPublished;
     RecentDeliveries delivered;  // on this connection
     std::chrono::milliseconds unansweredAllowed;  // the wait before the next resend
     bool stopping = false;
