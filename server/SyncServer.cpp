@@ -82,8 +82,8 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
     std::optional<SyncProtocol::Delta> appended;
     uint64_t& lastTaken = session.lastTaken[change.collectionName];
     try {
+        requireFollowsLastTaken(protocol::previousVersionIdOf(payload), change.versionId, lastTaken);
         earlier = storage->findAccepted(change);
-        if (!earlier) requireFollowsLastTaken(protocol::previousVersionIdOf(payload), lastTaken);
         if (!earlier) appended = storage->append(change);
         if (!appended && !earlier) earlier = storage->findAccepted(change);
         if (!appended && !earlier) {
@@ -119,12 +119,21 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
 
 // A change that names the one its client sent before it (in this
 // collection, since subscribing) comes only after that one: when the broker
-// lost the other, taking this one would log them out of order. The client
-// sends both again after its next subscription.
-void SyncServer::requireFollowsLastTaken(uint64_t previousVersionId, uint64_t lastTaken) {
-    if (previousVersionId == 0 || previousVersionId == lastTaken) return;
-    throw std::runtime_error("the change sent before it (version " + std::to_string(previousVersionId) +
-                             ") never arrived; waiting for a subscription");
+// lost the other, taking this one would log them out of order. One that
+// names itself is the first since the client subscribed, so it comes only
+// first on its session: a session that took changes already missed that
+// subscription (the broker lost it), and with it perhaps what was sent to
+// the client meanwhile. Either way the client sends them again after its
+// next subscription. Echoes too: an echo tells the client it holds the
+// session's changes up to the last one.
+void SyncServer::requireFollowsLastTaken(uint64_t previousVersionId, uint64_t versionId, uint64_t lastTaken) {
+    bool firstSinceSubscribing = previousVersionId == versionId;
+    if (previousVersionId == 0) return;
+    if (firstSinceSubscribing ? lastTaken == 0 : previousVersionId == lastTaken) return;
+    throw std::runtime_error(firstSinceSubscribing
+                                 ? "the client subscribed again but the subscription never arrived; waiting for it"
+                                 : "the change sent before it (version " + std::to_string(previousVersionId) +
+                                       ") never arrived; waiting for a subscription");
 }
 
 SyncServer::Receipt SyncServer::receiveSubscription(Session& session, const std::vector<unsigned char>& payload) {
@@ -132,8 +141,9 @@ SyncServer::Receipt SyncServer::receiveSubscription(Session& session, const std:
     requireValidCollectionName(request.collectionName);
     const std::string& name = request.collectionName;
     // The client sends everything it has not seen persisted again after
-    // this, oldest first.
+    // this, oldest first, naming none taken before.
     session.lostChanges.erase(name);
+    session.lastTaken.erase(name);
     // A session that already follows the collection has been sent every
     // change: what the client does not hold yet is on its way. Sending it
     // again would make the client apply older changes over newer ones.

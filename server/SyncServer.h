@@ -47,8 +47,10 @@
 //     logged ahead of the lost one; the client sends them all again, in
 //     order, after its next subscription. The same holds for a change
 //     that names a previous one (the client's previousVersionId, which the
-//     MQTT transport sends) this session has not accepted or echoed: the
-//     broker lost that one on the way.
+//     MQTT transport sends) other than the last this session accepted or
+//     echoed since the subscription: the broker lost that one on the way;
+//     or that names itself, the first since the client subscribed, when
+//     the session took changes already: the broker lost that subscription.
 //   - A change is sent to anyone only once the storage has recorded it.
 //
 // Threads: every operation may be called from any thread; one mutex guards
@@ -129,12 +131,12 @@ private:
         // the broker), until the next subscription to them.
         std::set<std::string> lostChanges;
         // Per collection, the highest version id of the session's client
-        // accepted or echoed on this session.
+        // accepted or echoed on this session since its subscription.
         std::map<std::string, uint64_t> lastTaken;
     };
 
     Receipt receiveChange(SessionId sessionId, Session& session, const std::vector<unsigned char>& payload);
-    static void requireFollowsLastTaken(uint64_t previousVersionId, uint64_t lastTaken);
+    static void requireFollowsLastTaken(uint64_t previousVersionId, uint64_t versionId, uint64_t lastTaken);
     Receipt receiveSubscription(Session& session, const std::vector<unsigned char>& payload);
     Receipt receiveSnapshotRequest(Session& session, const std::vector<unsigned char>& payload);
     std::vector<SyncProtocol::Delta> catchUpAfter(const std::string& collectionName, uint64_t sequenceNumber,

@@ -117,8 +117,9 @@ std::vector<unsigned char> makePayloadForSubscription(const SyncProtocol::Subscr
 // other than SAVE or DELETE.
 std::vector<unsigned char> makePayloadForSendDelta(const SyncProtocol::Delta& delta);
 // The same, naming the version id of the change the transport sent just
-// before this one in the same collection (previousVersionId in the schema;
-// not written when 0), so that a server can tell that one was lost.
+// before this one in the same collection since subscribing, or the change's
+// own for the first (previousVersionId in the schema; not written when 0),
+// so that a server can tell that one, or the subscription, was lost.
 std::vector<unsigned char> makePayloadForSendDelta(const SyncProtocol::Delta& delta, uint64_t previousVersionId);
 // The previousVersionId of a ServerDelta buffer; 0 when it has none. Throws
 // as makeTessarineDelta does for a buffer that is not valid.

@@ -486,9 +486,10 @@ TEST_F(EmbeddedSyncTest, UnansweredChangeIsResentAfterSubscribingAgainAndRepeate
     }));
     // At most two copies go out at the start (a write racing the first
     // connection's resend); the last ones are a resend of unanswered changes,
-    // each naming the one sent before it since the subscription.
+    // each naming the one sent before it since the subscription, the first
+    // itself.
     auto last = std::find(seen.rbegin(), seen.rend(), "change 2 after 1");
-    EXPECT_EQ("change 1 after 0", *(last + 1));
+    EXPECT_EQ("change 1 after 1", *(last + 1));
     EXPECT_EQ(ts::protocol::TOPIC_SUBSCRIBE_COLLECTION, *(last + 2));
     // The third forward comes after the first one's copy.
     ASSERT_TRUE(waitUntil([&] {

@@ -300,16 +300,20 @@ TEST(SyncServerLostChangeTest, LaterChangesOfTheSessionWaitForTheNextSubscriptio
     writer.send(change("w", 2, "b"));
     EXPECT_EQ((Lines{"list 1: w/1 a=1", "list 2: w/2 b=1"}), writer.take());
 
-    // The broker lost version 3, which 4 names as sent before it.
-    EXPECT_EQ(Outcome::DROPPED, writer.send(change("w", 4, "d"), 3).outcome);
-    EXPECT_EQ(Outcome::DROPPED, writer.send(change("w", 5, "e"), 4).outcome);
-    // A new connection: the client resends what it has not seen persisted.
+    // Changes that name the one sent before them since the subscription,
+    // the first naming itself. A session that took changes already missed
+    // its client's new subscription:
+    EXPECT_EQ(Outcome::DROPPED, writer.send(change("w", 2, "b"), 2).outcome);
     Client resending(server);
     resending.subscribe("w", 2);
-    resending.send(change("w", 2, "b"));  // an echo counts as taken
+    resending.send(change("w", 2, "b"), 2);  // an echo counts as taken
     resending.send(change("w", 3, "c"), 2);
-    resending.send(change("w", 4, "d"), 3);
-    EXPECT_EQ((Lines{"list 2: w/2 b=1", "list 3: w/3 c=1", "list 4: w/4 d=1"}), resending.take());
+    // The broker lost version 4, which 5 names.
+    EXPECT_EQ(Outcome::DROPPED, resending.send(change("w", 5, "e"), 4).outcome);
+    resending.subscribe("w", 3);
+    resending.send(change("w", 4, "d"), 4);
+    resending.send(change("w", 5, "e"), 4);
+    EXPECT_EQ((Lines{"list 2: w/2 b=1", "list 3: w/3 c=1", "list 4: w/4 d=1", "list 5: w/5 e=1"}), resending.take());
 }
 
 TEST(SqliteLogStorageTest, ReopenedFileServesOnWithItsLogAndRefusesAcceptedChangesAgain) {

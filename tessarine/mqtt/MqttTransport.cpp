@@ -125,10 +125,11 @@ int MqttTransport::publishChange(const Delta& delta) {
     // back before publish returns, finds the change.
     // The chain names what was tried, sent or not: a change after one that
     // did not go out must not be taken before it.
-    uint64_t& previous = lastPublished[{delta.clientId, delta.collectionName}];
+    // The first since the resynchronisation names itself.
+    auto [last, first] = lastPublished.try_emplace({delta.clientId, delta.collectionName}, delta.versionId);
     int messageId =
-        connection.publish(protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta, previous));
-    previous = delta.versionId;
+        connection.publish(protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta, last->second));
+    last->second = delta.versionId;
     if (messageId == 0) return 0;
     unacknowledged[messageId] = delta;
     unanswered.published(delta.collectionName, delta.versionId, std::chrono::steady_clock::now());
@@ -170,8 +171,8 @@ void MqttTransport::resynchronise() {
     std::lock_guard<std::mutex> resynchronisingLock(resynchronisingMutex);
     {
         // Everything unanswered goes again now, and is timed again; the
-        // first change of each collection after the subscription names none
-        // before it.
+        // first change of each collection after the subscription names
+        // itself.
         std::lock_guard<std::mutex> lock(mutex);
         unanswered.clear();
         lastPublished.clear();

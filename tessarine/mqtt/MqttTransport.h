@@ -29,10 +29,11 @@
 // right after it, in order. The server, for its part, takes a client's
 // changes only after that client's subscription (NetworkSyncServer). And
 // each change names the one published before it in its collection since
-// the resynchronisation (previousVersionId on the wire): a broker that loses
-// a change yet delivers later ones (a NATS node, acknowledging them all)
-// cannot make the server log them first, as it refuses a change whose
-// previous one it did not take, and everything after it, until the client
+// the resynchronisation, the first naming itself (previousVersionId on the
+// wire): a broker that loses a change yet delivers later ones (a NATS node,
+// acknowledging them all), or loses the subscription before them, cannot
+// make the server log them out of order or take them on a session of
+// before: it refuses them, and everything after, until the client
 // subscribes again (see Unanswered changes).
 //
 // Statuses: sendDelta returns 1 when the change went (or, held, goes) to
@@ -150,7 +151,7 @@ private:
     UnansweredChanges unanswered;
     // By (client id, collection): the version id of the last change published
     // since the last resynchronisation, which the next one names as its
-    // previous (see Order, above).
+    // previous (see Order, above); the first names itself.
     std::map<std::pair<std::string, std::string>, uint64_t> lastPublished;
     RecentDeliveries delivered;  // on this connection
     std::chrono::milliseconds unansweredAllowed;  // the wait before the next resend
