@@ -82,7 +82,7 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
     std::optional<SyncProtocol::Delta> appended;
     uint64_t& lastTaken = session.lastTaken[change.collectionName];
     try {
-        requireFollowsLastTaken(protocol::previousVersionIdOf(payload), change.versionId, lastTaken);
+        requireFollowsLastTaken(change, protocol::previousVersionIdOf(payload), lastTaken);
         earlier = storage->findAccepted(change);
         if (!earlier) appended = storage->append(change);
         if (!appended && !earlier) earlier = storage->findAccepted(change);
@@ -118,22 +118,27 @@ SyncServer::Receipt SyncServer::receiveChange(SessionId sessionId, Session& sess
 }
 
 // A change that names the one its client sent before it (in this
-// collection, since subscribing) comes only after that one: when the broker
-// lost the other, taking this one would log them out of order. One that
-// names itself is the first since the client subscribed, so it comes only
-// first on its session: a session that took changes already missed that
-// subscription (the broker lost it), and with it perhaps what was sent to
-// the client meanwhile. Either way the client sends them again after its
-// next subscription. Echoes too: an echo tells the client it holds the
-// session's changes up to the last one.
-void SyncServer::requireFollowsLastTaken(uint64_t previousVersionId, uint64_t versionId, uint64_t lastTaken) {
-    bool firstSinceSubscribing = previousVersionId == versionId;
+// collection, since subscribing) comes only after that one is logged: when
+// the broker lost the other, taking this one would log them out of order.
+// One that names itself is the first since the client subscribed, so it
+// comes only first on its session: a session that took changes already
+// missed that subscription (the broker lost it), and with it perhaps what
+// was sent to the client meanwhile; echoes included, as an echo tells the
+// client it holds the session's changes up to the last one. Either way the
+// client sends them again after its next subscription.
+void SyncServer::requireFollowsLastTaken(const SyncProtocol::Delta& change, uint64_t previousVersionId,
+                                         uint64_t lastTaken) const {
     if (previousVersionId == 0) return;
-    if (firstSinceSubscribing ? lastTaken == 0 : previousVersionId == lastTaken) return;
-    throw std::runtime_error(firstSinceSubscribing
-                                 ? "the client subscribed again but the subscription never arrived; waiting for it"
-                                 : "the change sent before it (version " + std::to_string(previousVersionId) +
-                                       ") never arrived; waiting for a subscription");
+    if (previousVersionId == change.versionId) {
+        if (lastTaken == 0) return;
+        throw std::runtime_error("the client subscribed again but the subscription never arrived; waiting for it");
+    }
+    if (previousVersionId == lastTaken) return;
+    SyncProtocol::Delta previous = change;
+    previous.versionId = previousVersionId;
+    if (storage->findAccepted(previous)) return;  // taken on an earlier session
+    throw std::runtime_error("the change sent before it (version " + std::to_string(previousVersionId) +
+                             ") never arrived; waiting for a subscription");
 }
 
 SyncServer::Receipt SyncServer::receiveSubscription(Session& session, const std::vector<unsigned char>& payload) {

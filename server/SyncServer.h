@@ -47,8 +47,8 @@
 //     logged ahead of the lost one; the client sends them all again, in
 //     order, after its next subscription. The same holds for a change
 //     that names a previous one (the client's previousVersionId, which the
-//     MQTT transport sends) other than the last this session accepted or
-//     echoed since the subscription: the broker lost that one on the way;
+//     MQTT transport sends) that is neither the last this session accepted
+//     or echoed since the subscription nor logged: the broker lost that one;
 //     or that names itself, the first since the client subscribed, when
 //     the session took changes already: the broker lost that subscription.
 //   - A change is sent to anyone only once the storage has recorded it.
@@ -136,7 +136,8 @@ private:
     };
 
     Receipt receiveChange(SessionId sessionId, Session& session, const std::vector<unsigned char>& payload);
-    static void requireFollowsLastTaken(uint64_t previousVersionId, uint64_t versionId, uint64_t lastTaken);
+    void requireFollowsLastTaken(const SyncProtocol::Delta& change, uint64_t previousVersionId,
+                                 uint64_t lastTaken) const;
     Receipt receiveSubscription(Session& session, const std::vector<unsigned char>& payload);
     Receipt receiveSnapshotRequest(Session& session, const std::vector<unsigned char>& payload);
     std::vector<SyncProtocol::Delta> catchUpAfter(const std::string& collectionName, uint64_t sequenceNumber,

@@ -65,6 +65,10 @@ int main(int argc, char** argv) {
     ts::mqtt::MqttTransport::Options options;
     options.port = std::stoi(argv[2]);
     options.maxReconnectDelaySeconds = 1;
+    // A broker that loses changes (a NATS node dying) costs a wait this long
+    // and then twice as long each time: short, so that the tests converge
+    // within their deadlines.
+    options.resendUnansweredAfter = std::chrono::seconds(2);
     if (argc == 9) {
         options.username = argv[7];
         options.password = argv[8];

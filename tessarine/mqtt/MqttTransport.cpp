@@ -123,10 +123,10 @@ int MqttTransport::sendDelta(const Delta& delta) {
 int MqttTransport::publishChange(const Delta& delta) {
     // Called with the lock held, so that the acknowledgement, which can come
     // back before publish returns, finds the change.
-    // The chain names what was tried, sent or not: a change after one that
-    // did not go out must not be taken before it.
-    // The first since the resynchronisation names itself.
-    auto [last, first] = lastPublished.try_emplace({delta.clientId, delta.collectionName}, delta.versionId);
+    // Each change names the one tried before it, sent or not (a change after
+    // one that did not go out must not be taken before it); the first since
+    // the resynchronisation names itself.
+    auto last = lastPublished.try_emplace({delta.clientId, delta.collectionName}, delta.versionId).first;
     int messageId =
         connection.publish(protocol::TOPIC_CHANGE_RECORD, protocol::makePayloadForSendDelta(delta, last->second));
     last->second = delta.versionId;
