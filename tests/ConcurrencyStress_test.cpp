@@ -15,7 +15,6 @@
 
 #include "StoreTestSupport.h"
 #include "SyncDevice.h"
-#include "Watchdog.h"
 #include "server/LoopbackTransport.h"
 #include "server/SyncServer.h"
 

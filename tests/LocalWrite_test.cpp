@@ -15,7 +15,6 @@
 
 #include "FaultyVfs.h"
 #include "StoreTestSupport.h"
-#include "Watchdog.h"
 
 namespace {
 

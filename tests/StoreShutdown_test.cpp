@@ -13,7 +13,6 @@
 #include <thread>
 
 #include "StoreTestSupport.h"
-#include "Watchdog.h"
 
 namespace {
 

@@ -1,5 +1,5 @@
-// Helpers shared by the tests: a temporary directory, a log capture and a
-// deadline-bounded wait.
+// Helpers shared by the tests: a temporary directory, a log capture, a
+// deadline-bounded wait and a watchdog.
 #pragma once
 
 #include <chrono>
@@ -61,6 +61,12 @@ std::string fileContent(const std::string& path);
 // test, and returns as soon as the condition holds.
 bool waitUntil(const std::function<bool()>& condition,
                std::chrono::milliseconds deadline = std::chrono::seconds(20));
+
+// Runs body, which could deadlock, on a thread of its own. When it has not
+// finished by the deadline the process prints what hung and aborts: the test
+// fails at once instead of stalling the run, and the abort leaves the stacks
+// of all threads to a debugger or core file.
+void runWithWatchdog(const char* what, std::chrono::seconds deadline, const std::function<void()>& body);
 
 // True while the thread of this process with the kernel id threadId (gettid)
 // sleeps in the kernel, as one waiting for a mutex that another thread holds
