@@ -40,21 +40,6 @@ protected:
     std::vector<std::string> listened;
 };
 
-TEST_F(DeltaQueueTest, AddDeltaQueuesRowAndOnlyACommittedOneIsSentStamped) {
-    Delta delta = remoteSave("a:b", "k", 0);
-    delta.clientId = "";
-    delta.versionId = 4;
-    const int64_t queueId = deltaQueue->addDelta(delta, Status::PENDING);
-    EXPECT_TRUE(transport->sentDeltas().empty());
-    deltaQueue->addCommitted(queueId, delta);
-    deltaQueue->sendCommitted();
-    auto sent = transport->sentDeltas();
-    ASSERT_EQ(1u, sent.size());
-    EXPECT_EQ(clientId, sent[0].clientId);
-    EXPECT_EQ(4u, sent[0].versionId);
-    EXPECT_EQ(Status::PENDING, deltaQueueStorage->getDeltaStatus(delta).value());
-}
-
 TEST_F(DeltaQueueTest, StatusUpdatesChangeRowsOnWorkerAndReachListenersOnlyOnChange) {
     listen();
     Delta delta = localSave("a:b", "k");
