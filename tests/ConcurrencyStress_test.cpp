@@ -17,14 +17,6 @@
 #include "server/LoopbackTransport.h"
 #include "server/SyncServer.h"
 
-#if defined(__SANITIZE_THREAD__)
-#define TESSARINE_TEST_THREAD_SANITIZER 1
-#elif defined(__has_feature)
-#if __has_feature(thread_sanitizer)
-#define TESSARINE_TEST_THREAD_SANITIZER 1
-#endif
-#endif
-
 namespace {
 
 namespace ts = lumivale::tessarine;
@@ -35,7 +27,7 @@ using Bytes = std::vector<unsigned char>;
 
 // Sized for about a minute under ThreadSanitizer, the build this test is
 // for; the other builds run it in seconds.
-#if defined(TESSARINE_TEST_THREAD_SANITIZER)
+#if defined(TESSARINE_TEST_THREAD_SANITIZED)
 constexpr int kWritesPerThread = 6000;
 #elif defined(TESSARINE_TEST_EMULATED)
 constexpr int kWritesPerThread = 500;

@@ -13,14 +13,6 @@
 #include "CrashJournal.h"
 #include "StoreTestSupport.h"
 
-#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
-#define TESSARINE_TEST_SANITIZED 1
-#elif defined(__has_feature)
-#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
-#define TESSARINE_TEST_SANITIZED 1
-#endif
-#endif
-
 namespace {
 
 namespace ts = lumivale::tessarine;
