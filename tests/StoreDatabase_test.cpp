@@ -21,34 +21,6 @@ std::string pragma(Database& db, const std::string& name) {
     return s.step() ? s(0).getText() : "";
 }
 
-}  // namespace
-
-TEST(StoreDatabaseTest, StoreTuningIsInEffect) {
-    testsupport::TempDir dir;
-    auto db = Tessarine::createSqliteDatabase(dir.file("store.db"), TessarineOptions());
-    EXPECT_EQ("2", pragma(*db, "temp_store"));  // MEMORY
-    EXPECT_EQ("wal", pragma(*db, "journal_mode"));
-    EXPECT_EQ("1", pragma(*db, "synchronous"));  // NORMAL
-    EXPECT_EQ("1000", pragma(*db, "busy_timeout"));
-
-    TessarineOptions other;
-    other.synchronous = "FULL";
-    other.busyTimeout = 250;
-    auto second = Tessarine::createSqliteDatabase(dir.file("other.db"), other);
-    EXPECT_EQ("2", pragma(*second, "synchronous"));
-    EXPECT_EQ("250", pragma(*second, "busy_timeout"));
-}
-
-TEST(StoreDatabaseTest, OpeningFailuresThrow) {
-    testsupport::TempDir dir;
-    EXPECT_THROW(Tessarine::createSqliteDatabase(dir.file("missing/store.db"), TessarineOptions()), SQLiteException);
-    TessarineOptions bad;
-    bad.journalMode = "WAL; DROP";
-    EXPECT_THROW(Tessarine::createSqliteDatabase(dir.file("bad.db"), bad), SQLiteException);
-}
-
-namespace {
-
 // A store whose file walk uses path while its tables live in db, so that the
 // walk can be tested on files that are not databases.
 std::unique_ptr<Tessarine> storeOver(std::shared_ptr<Database> db, const std::string& path) {
@@ -62,6 +34,26 @@ std::unique_ptr<Tessarine> openStore(const std::string& path) {
 }
 
 }  // namespace
+
+TEST(StoreDatabaseTest, StoreTuningIsInEffectAndOpeningFailuresThrow) {
+    testsupport::TempDir dir;
+    auto db = Tessarine::createSqliteDatabase(dir.file("store.db"), TessarineOptions());
+    EXPECT_EQ("2", pragma(*db, "temp_store"));  // MEMORY
+    EXPECT_EQ("wal", pragma(*db, "journal_mode"));
+    EXPECT_EQ("1", pragma(*db, "synchronous"));  // NORMAL
+    EXPECT_EQ("1000", pragma(*db, "busy_timeout"));
+
+    TessarineOptions other;
+    other.synchronous = "FULL";
+    other.busyTimeout = 250;
+    auto second = Tessarine::createSqliteDatabase(dir.file("other.db"), other);
+    EXPECT_EQ("2", pragma(*second, "synchronous"));
+    EXPECT_EQ("250", pragma(*second, "busy_timeout"));
+
+    EXPECT_THROW(Tessarine::createSqliteDatabase(dir.file("missing/store.db"), TessarineOptions()), SQLiteException);
+    other.journalMode = "WAL; DROP";
+    EXPECT_THROW(Tessarine::createSqliteDatabase(dir.file("bad.db"), other), SQLiteException);
+}
 
 TEST(StoreDatabaseTest, RemoveStopsTheStoreAndDeletesDatabaseAndCompanions) {
     for (const std::string path : {"", ":memory:"}) {  // no files: nothing to delete, twice
