@@ -5,7 +5,6 @@
 namespace {
 
 using testsupport::LogCapture;
-using testsupport::waitUntil;
 namespace ts = lumivale::tessarine;
 using ObjectStatus = ts::CollectionStorage::ObjectStatus;
 
@@ -164,22 +163,6 @@ TEST_F(DeltaHandlerTest, StatusFollowsLeastAdvancedQueuedDeltaWhateverTheOrderOf
     EXPECT_EQ(0, object("a:b", "k").first);
     EXPECT_EQ(Status::SENT, receivedDeltas().back().status);
     EXPECT_EQ(ts::SyncProtocol::DeltaType::DELETE, receivedDeltas().back().type);
-}
-
-TEST_F(DeltaHandlerTest, FailingDeliveryAppliesNothingAndIsRetriedWhole) {
-    LogCapture log;
-    transport->onDeltaReceived({remoteSave("a:b", "k1", 5), remoteSave("x:y", "k2", 6)});  // x:y has no table yet
-    ASSERT_TRUE(waitUntil([&] { return !log.linesStartingWith("Failed to process received deltas: no such table").empty(); }));
-    EXPECT_EQ(0, object("a:b", "k1").first);
-    EXPECT_TRUE(receivedDeltas().empty());
-    collectionStorage->ensureTableExistsForCollection("x:y");
-    drainJobs();
-    EXPECT_EQ(3, object("a:b", "k1").first);
-    EXPECT_EQ(3, object("x:y", "k2").first);
-    EXPECT_EQ(2u, receivedDeltas().size());  // one callback batch, after the successful attempt
-
-    deliver({});
-    EXPECT_EQ(2u, receivedDeltas().size());
 }
 
 TEST_F(DeltaHandlerTest, StoppedHandlerRefusesWritesAndDropsEvents) {
