@@ -109,6 +109,8 @@ TEST_F(DeltaHandlerTest, DeliveryOverSeveralCollectionsAndClientsStoresEachOnesL
     EXPECT_EQ(0u, versionVectorStorage->getCollectionVersion("a:c", clientId));
     deliver({from("X", "a:b", 3, 34)});  // lower than stored: kept
     EXPECT_EQ(5u, versionVectorStorage->getCollectionVersion("a:b", "X"));
+    deliver({from("Z", "a:b", UINT64_MAX - 1, 35), from("Z", "a:b", 9, 36)});  // compared unsigned
+    EXPECT_EQ(UINT64_MAX - 1, versionVectorStorage->getCollectionVersion("a:b", "Z"));
 }
 
 TEST_F(DeltaHandlerTest, OwnEchoRetiresQueueRowWithoutRewritingObject) {

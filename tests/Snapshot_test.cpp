@@ -99,21 +99,4 @@ TEST_F(SnapshotTest, GeneratedSnapshotListsObjectsInSortOrderWithNumbers) {
     EXPECT_EQ(0u, generator.generateSnapshot("a:b", "NOBODY").versionId);
 }
 
-TEST(VersionVectorStorageTest, KeepsHighestUnsignedVersionPerCollectionAndClient) {
-    testsupport::TempDir dir;
-    {
-        ts::VersionVectorStorage storage(ts::Tessarine::createSqliteDatabase(dir.file("v.db"), {}));
-        storage.updateCollectionVersionVector("a:b", "C1", 5);
-        storage.updateCollectionVersionVector("a:b", "C1", 3);
-        storage.updateCollectionVersionVector("a:b", "C2", UINT64_MAX - 1);
-        storage.updateCollectionVersionVector("a:b", "C2", 9);
-        storage.updateCollectionVersionVector("x:y", "C1", 1);
-    }
-    ts::VersionVectorStorage storage(ts::Tessarine::createSqliteDatabase(dir.file("v.db"), {}));
-    EXPECT_EQ(5u, storage.getCollectionVersion("a:b", "C1"));
-    EXPECT_EQ(UINT64_MAX - 1, storage.getCollectionVersion("a:b", "C2"));
-    EXPECT_EQ(1u, storage.getCollectionVersion("x:y", "C1"));
-    EXPECT_EQ(0u, storage.getCollectionVersion("x:y", "C2"));
-}
-
 }  // namespace
