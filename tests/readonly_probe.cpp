@@ -19,6 +19,7 @@
 #include <thread>
 #include <vector>
 
+#include "FakeTransport.h"
 #include "platform/Log.h"
 #include "tessarine/Tessarine.h"
 
@@ -27,13 +28,6 @@ namespace {
 using namespace lumivale::tessarine;
 
 constexpr uid_t kUnprivilegedId = 65534;
-
-class SilentTransport : public SyncProtocol {
-    void start() override {}
-    void sendSubscriptionRequest(const SubscriptionRequest&) override {}
-    int sendDelta(const Delta&) override { return 0; }
-    void sendSnapshotRequest(const std::string&, const std::string&) override {}
-};
 
 bool dropRootRights() {
     if (geteuid() != 0) return true;
@@ -56,7 +50,7 @@ int main(int argc, char** argv) {
     lumivale::setLogSink([report](int priority, const std::string&, const std::string& message) {
         std::fprintf(report, "log %d %s\n", priority, message.c_str());
     });
-    auto store = Tessarine::open(argv[1], std::make_shared<SilentTransport>(), std::make_shared<StdThreadCreator>());
+    auto store = Tessarine::open(argv[1], std::make_shared<testsupport::FakeTransport>(), std::make_shared<StdThreadCreator>());
     std::fprintf(report, "open %s\n", store ? "ok" : "failed");
     if (!store) return 0;
     auto items = store->subscribeCollection("app:items");
