@@ -71,7 +71,7 @@ TEST_F(DeltaHandlerTest, ThrowingTransportKeepsWritesQueuedUntilTheNextConnectio
 
 TEST_F(DeltaHandlerTest, RemoteDeltasApplyAsPersistedUnlessLocalChangeIsQueued) {
     localSave("a:b", "mine", {1});
-    deliver({remoteSave("a:b", "theirs", 10, {2}), remoteSave("a:b", "mine", 11, {3})});
+    deliver({testsupport::remoteDelta("a:b", "theirs", 10, {2}), testsupport::remoteDelta("a:b", "mine", 11, {3})});
     EXPECT_EQ(std::make_pair(3, std::vector<unsigned char>{2}), object("a:b", "theirs"));
     EXPECT_EQ(std::make_pair(1, std::vector<unsigned char>{1}), object("a:b", "mine"));  // local change wins
     auto got = receivedDeltas();
@@ -81,7 +81,7 @@ TEST_F(DeltaHandlerTest, RemoteDeltasApplyAsPersistedUnlessLocalChangeIsQueued) 
     EXPECT_EQ(11u, subscriptionManager->getSequenceNumber("a:b"));
     EXPECT_EQ(11u, versionVectorStorage->getCollectionVersion("a:b", "OTHERCLIENT"));
 
-    Delta remove = remoteSave("a:b", "theirs", 12);
+    Delta remove = testsupport::remoteDelta("a:b", "theirs", 12);
     remove.type = ts::SyncProtocol::DeltaType::DELETE;
     deliver({remove});
     EXPECT_EQ(0, object("a:b", "theirs").first);
@@ -93,7 +93,7 @@ TEST_F(DeltaHandlerTest, DeliveryOverSeveralCollectionsAndClientsStoresEachOnesL
     subscriptionManager->subscribeCollection("a:c");
     collectionStorage->ensureTableExistsForCollection("a:c");
     auto from = [&](const std::string& client, const std::string& collection, uint64_t version, uint64_t sequence) {
-        Delta delta = remoteSave(collection, "k" + std::to_string(sequence), sequence);
+        Delta delta = testsupport::remoteDelta(collection, "k" + std::to_string(sequence), sequence);
         delta.clientId = client;
         delta.versionId = version;
         return delta;
@@ -177,7 +177,7 @@ TEST_F(DeltaHandlerTest, StoppedHandlerRefusesWritesAndDropsEvents) {
         EXPECT_STREQ("DeltaHandler already stopped", e.what());
     }
     EXPECT_EQ(before + 1, versionIdGenerator->queryVersionId("a:b"));  // the id is used up
-    deliver({remoteSave("a:b", "k", 1)});
+    deliver({testsupport::remoteDelta("a:b", "k", 1)});
     EXPECT_EQ(0, object("a:b", "k").first);
     EXPECT_TRUE(receivedDeltas().empty());
 }
@@ -193,7 +193,7 @@ TEST_F(DeltaHandlerTest, CallbacksSurviveThrowingAndEmptyCallbacksAndBadNumbers)
     EXPECT_EQ(1u, log.linesStartingWith("Exception in delta callback: app bug").size());
     EXPECT_EQ(2u, log.linesStartingWith("Exception in delta callback: ").size());
 
-    Delta odd = remoteSave("a:b", "k", 1);
+    Delta odd = testsupport::remoteDelta("a:b", "k", 1);
     odd.type = static_cast<ts::SyncProtocol::DeltaType>(9);
     ts::Delta api = deltaHandler->convertMQTTDeltaToApiDelta(odd, static_cast<Status>(0));
     EXPECT_EQ("k", api.primaryKey);
@@ -202,13 +202,13 @@ TEST_F(DeltaHandlerTest, CallbacksSurviveThrowingAndEmptyCallbacksAndBadNumbers)
     EXPECT_EQ(ObjectStatus::PERSISTED, deltaHandler->convToObjectStatus(static_cast<ts::DeltaQueue::PendingStatus>(7)));
     EXPECT_EQ(1u, log.linesStartingWith("Unknown pending status: 7").size());
 
-    deliver({odd, remoteSave("a:b", "fine", 2)});  // the unknown type is dropped, the rest applied
+    deliver({odd, testsupport::remoteDelta("a:b", "fine", 2)});  // the unknown type is dropped, the rest applied
     EXPECT_EQ(3, object("a:b", "fine").first);
     EXPECT_EQ(1u, log.linesStartingWith("Dropping received delta of unknown type: 9").size());
 }
 
 TEST_F(DeltaHandlerTest, ApplyingUnknownTypeIsABrokenInvariant) {
-    Delta odd = remoteSave("a:b", "k", 1);
+    Delta odd = testsupport::remoteDelta("a:b", "k", 1);
     odd.type = static_cast<ts::SyncProtocol::DeltaType>(5);
     EXPECT_DEATH(deltaHandler->applyDelta(odd, ObjectStatus::PERSISTED),
                  "Assert \\(DeltaHandler:[0-9]+\\): Unknown delta type: 5");

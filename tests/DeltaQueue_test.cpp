@@ -132,4 +132,11 @@ TEST_F(FlakyDeltaQueueTest, FailedStatusTransactionRollsBackAndIsRetried) {
     EXPECT_EQ(std::vector<std::string>{"k:2"}, heard());  // once, after the successful attempt
 }
 
+using DeltaQueueDeathTest = DeltaQueueTest;
+
+TEST_F(DeltaQueueDeathTest, StoringPersistedIsABrokenInvariant) {
+    EXPECT_DEATH(deltaQueueStorage->updateDeltaStatus(localSave("a:b", "k"), Status::PERSISTED),
+                 "Assert \\(DeltaQueueStorage:[0-9]+\\): Deltas with status=PERSISTED should be deleted from the queue");
+}
+
 }  // namespace

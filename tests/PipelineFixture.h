@@ -55,9 +55,7 @@ protected:
     }
 
     // Releases the components in the store's destruction order.
-    void tearDownComponents() { ts::StoreComponents released(std::move(components())); }
-
-    void TearDown() override { tearDownComponents(); }
+    void TearDown() override { ts::StoreComponents released(std::move(components())); }
 
     // A local write as a collection handle makes it.
     Delta localSave(const std::string& collection, const std::string& key, std::vector<unsigned char> blob = {7}) {
@@ -70,11 +68,6 @@ protected:
         delta.blob = std::move(blob);
         delta.versionId = deltaHandler->addLocalDeltaWithNextVersionId(delta);
         return delta;
-    }
-
-    static Delta remoteSave(const std::string& collection, const std::string& key, uint64_t sequenceNumber,
-                            std::vector<unsigned char> blob = {9}) {
-        return remoteDelta(collection, key, sequenceNumber, std::move(blob));
     }
 
     // Status and blob of an object, or status 0 when it has no row.

@@ -87,7 +87,7 @@ TEST_F(SnapshotTest, GeneratedSnapshotListsObjectsInSortOrderWithNumbers) {
     EXPECT_EQ(0u, unsubscribed.sequenceNumber);
     EXPECT_TRUE(unsubscribed.objects.empty());
 
-    transport->onDeltaReceived({remoteSave("a:b", "b", 4, {2}), remoteSave("a:b", "a", 7, {1})});
+    transport->onDeltaReceived({testsupport::remoteDelta("a:b", "b", 4, {2}), testsupport::remoteDelta("a:b", "a", 7, {1})});
     drainJobs();
     auto snapshot = generator.generateSnapshot("a:b", "OTHERCLIENT");
     EXPECT_EQ("a:b", snapshot.collectionName);
