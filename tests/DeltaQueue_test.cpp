@@ -5,7 +5,6 @@
 namespace {
 
 using testsupport::LogCapture;
-using testsupport::waitUntil;
 namespace ts = lumivale::tessarine;
 
 // Fails its first `failures` status writes, as a busy or broken database would.

@@ -13,7 +13,6 @@ namespace {
 namespace ts = lumivale::tessarine;
 using Direction = ts::CollectionStorage::SortDirection;
 using testsupport::LogCapture;
-using testsupport::rows;
 using testsupport::StoredObject;
 using testsupport::storedObjects;
 using testsupport::StoreUnderTest;

@@ -2,7 +2,6 @@
 // the files it refuses, and a store that another process is writing.
 #include <gtest/gtest.h>
 
-#include <filesystem>
 #include <fstream>
 #include <sstream>
 

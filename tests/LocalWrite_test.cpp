@@ -6,7 +6,6 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <map>
 #include <string>
 #include <thread>
 #include <vector>

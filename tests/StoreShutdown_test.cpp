@@ -17,7 +17,6 @@
 namespace {
 
 namespace ts = lumivale::tessarine;
-using Direction = ts::CollectionStorage::SortDirection;
 using Bytes = std::vector<unsigned char>;
 
 // A transport that only counts what it is asked to send.
