@@ -169,7 +169,7 @@ TEST_F(CrashDurabilityTest, AcknowledgedWritesSurviveSigkillAndQueueIsResentOnce
             // Most kills come while the writer runs its loops; some while it
             // is still opening the store.
             if (random() % 8 != 0) {
-                ASSERT_TRUE(testsupport::waitUntil([&] { return !testsupport::journalLines(journalPath).empty(); }))
+                ASSERT_TRUE(testsupport::waitUntil([&] { return !testsupport::fileLines(journalPath).empty(); }))
                     << "the writer did not start";
             }
             // The random moment of the kill, not a wait for the writer.
@@ -179,7 +179,7 @@ TEST_F(CrashDurabilityTest, AcknowledgedWritesSurviveSigkillAndQueueIsResentOnce
             ASSERT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == SIGKILL)
                 << "the writer ended by itself: " << testsupport::describeWaitStatus(status);
         }
-        std::vector<std::string> journal = testsupport::journalLines(journalPath);
+        std::vector<std::string> journal = testsupport::fileLines(journalPath);
         acknowledgedWrites += journal.empty() ? 0 : journal.size() - 1;
         verifyAfterKill(seed, journal, cycle);
         if (HasFatalFailure()) return;

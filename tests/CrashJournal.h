@@ -5,10 +5,7 @@
 // the next write starts. Remote batches save r0..r7 with remoteBlob(sequence).
 #pragma once
 
-#include <fstream>
-#include <iterator>
 #include <random>
-#include <sstream>
 #include <string>
 #include <unordered_map>
 #include <vector>
@@ -55,15 +52,5 @@ public:
 private:
     std::mt19937 random;
 };
-
-// The whole lines of a journal; a last line cut off by the kill is left out.
-inline std::vector<std::string> journalLines(const std::string& path) {
-    std::ifstream in(path);
-    std::string content((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    std::istringstream text(content.substr(0, content.rfind('\n') + 1));
-    std::vector<std::string> lines;
-    for (std::string line; std::getline(text, line);) lines.push_back(line);
-    return lines;
-}
 
 }  // namespace testsupport

@@ -194,7 +194,7 @@ TEST(InspectorTest, StoreHeldOpenByAWritingProcessIsReadConsistentlyWithoutStopp
     const std::string path = dir.file("store.db");
     const std::string journalPath = dir.file("journal");
     testsupport::ChildProcess writer(TESSARINE_CRASH_WRITER, {path, journalPath, "7", "1"}, TESSARINE_TEST_EMULATOR);
-    auto acknowledged = [&] { return testsupport::journalLines(journalPath).size(); };  // "ready" and ids
+    auto acknowledged = [&] { return testsupport::fileLines(journalPath).size(); };  // "ready" and ids
     ASSERT_TRUE(testsupport::waitUntil([&] { return acknowledged() > 20; })) << "the writer did not start";
     for (int round = 0; round < 3; ++round) {
         inspect::StoreSummary summary = inspect::StoreInspector(path).summary();

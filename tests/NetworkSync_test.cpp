@@ -5,7 +5,6 @@
 #include <sqlite3.h>
 
 #include <filesystem>
-#include <fstream>
 #include <algorithm>
 #include <mutex>
 #include <map>
@@ -41,13 +40,6 @@ constexpr std::chrono::seconds kConvergeDeadline(30);
 // A NATS node refuses connections and subscriptions for seconds at a time
 // while JetStream elects leaders, more so on a loaded machine.
 constexpr std::chrono::seconds kClusterDeadline(90);
-
-std::vector<std::string> readLines(const std::string& path) {
-    std::vector<std::string> lines;
-    std::ifstream in(path);
-    for (std::string line; std::getline(in, line);) lines.push_back(line);
-    return lines;
-}
 
 // A server file read while (or after) tessarine-server writes it.
 class ServerFile {
@@ -107,7 +99,7 @@ protected:
             TESSARINE_TEST_EMULATOR));
         tags.push_back(tag);
     }
-    std::vector<std::string> deviceRows(const std::string& tag) { return readLines(dir.file(tag + ".state")); }
+    std::vector<std::string> deviceRows(const std::string& tag) { return testsupport::fileLines(dir.file(tag + ".state")); }
     // 0 also while the server has not made its file yet.
     int64_t changesLogged() {
         try {
@@ -150,7 +142,7 @@ protected:
         EXPECT_EQ(count,
                   file.single("SELECT IFNULL(MAX(sequence), 0) FROM changes WHERE collection = ?", {kCollection}));
         for (const std::string& tag : tags) {
-            std::vector<std::string> persisted = readLines(dir.file(tag + ".state.persisted"));
+            std::vector<std::string> persisted = testsupport::fileLines(dir.file(tag + ".state.persisted"));
             EXPECT_FALSE(persisted.empty()) << tag;
             for (const std::string& line : persisted) {
                 std::istringstream words(line);

@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <fstream>
 #include <random>
+#include <sstream>
 #include <thread>
 #include <unistd.h>
 
@@ -72,6 +73,13 @@ void runWithWatchdog(const char* what, std::chrono::seconds deadline, const std:
     }
     lock.unlock();
     runner.join();
+}
+
+std::vector<std::string> fileLines(const std::string& path) {
+    std::istringstream text(fileContent(path));
+    std::vector<std::string> lines;
+    for (std::string line; std::getline(text, line) && !text.eof();) lines.push_back(line);
+    return lines;
 }
 
 bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds deadline) {

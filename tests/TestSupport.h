@@ -55,6 +55,9 @@ private:
 
 // The whole content of a file; empty when it cannot be read.
 std::string fileContent(const std::string& path);
+// The whole lines of a file (a last line without its newline, as a writer
+// may leave it, is left out); none when it cannot be read.
+std::vector<std::string> fileLines(const std::string& path);
 
 // Waits until condition() holds or the deadline passes; returns the last
 // value of condition(). Polls, so it needs no cooperation from the code under
