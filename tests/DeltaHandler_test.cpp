@@ -38,7 +38,7 @@ TEST_F(DeltaHandlerTest, LocalSaveIsQueuedSentStoredPendingAndReportedAtOnce) {
     EXPECT_EQ(1, object("a:b", "k").first);
     ASSERT_EQ(1u, transport->sentDeltas().size());
     EXPECT_EQ(clientId, transport->sentDeltas()[0].clientId);
-    auto got = receivedDeltas();  // synchronously, on this thread
+    auto got = heard.all();  // synchronously, on this thread
     ASSERT_EQ(1u, got.size());
     EXPECT_EQ(Status::PENDING, got[0].status);
     EXPECT_EQ((std::vector<unsigned char>{1, 0, 2}), got[0].blob);
@@ -60,7 +60,7 @@ TEST_F(DeltaHandlerTest, ThrowingTransportKeepsWritesQueuedUntilTheNextConnectio
     EXPECT_TRUE(transport->sentDeltas().empty());
     EXPECT_EQ(2u, deltaQueueStorage->getAllDeltas().size());
     EXPECT_EQ(std::make_pair(1, std::vector<unsigned char>{2}), object("a:b", "k"));
-    EXPECT_EQ(2u, receivedDeltas().size());  // both writes reported PENDING
+    EXPECT_EQ(2u, heard.all().size());  // both writes reported PENDING
 
     transport->onConnectionEstablished();
     localSave("a:b", "k", {3});
@@ -74,7 +74,7 @@ TEST_F(DeltaHandlerTest, RemoteDeltasApplyAsPersistedUnlessLocalChangeIsQueued) 
     deliver({testsupport::remoteDelta("a:b", "theirs", 10, {2}), testsupport::remoteDelta("a:b", "mine", 11, {3})});
     EXPECT_EQ(std::make_pair(3, std::vector<unsigned char>{2}), object("a:b", "theirs"));
     EXPECT_EQ(std::make_pair(1, std::vector<unsigned char>{1}), object("a:b", "mine"));  // local change wins
-    auto got = receivedDeltas();
+    auto got = heard.all();
     ASSERT_EQ(3u, got.size());
     EXPECT_EQ(Status::PERSISTED, got[1].status);
     EXPECT_EQ(Status::PERSISTED, got[2].status);  // reported even though not applied
@@ -129,7 +129,7 @@ TEST_F(DeltaHandlerTest, OwnEchoRetiresQueueRowWithoutRewritingObject) {
     deliver({echo(second, 22)});  // row already gone: no recomputation, number still stored
     EXPECT_EQ(2, object("a:b", "k").first);
     EXPECT_EQ(22u, subscriptionManager->getSequenceNumber("a:b"));
-    EXPECT_EQ(Status::PERSISTED, receivedDeltas().back().status);
+    EXPECT_EQ(Status::PERSISTED, heard.all().back().status);
 }
 
 // An object's status is its least advanced queued change's; a PERSISTED
@@ -148,7 +148,7 @@ TEST_F(DeltaHandlerTest, StatusFollowsLeastAdvancedQueuedDeltaWhateverTheOrderOf
     EXPECT_EQ(3, object("a:b", "k").first);
     report(newer, Status::PERSISTED);  // finds no row: reaches nobody
     std::vector<Status> statuses;
-    for (const auto& d : receivedDeltas()) statuses.push_back(d.status);
+    for (const auto& d : heard.all()) statuses.push_back(d.status);
     EXPECT_EQ((std::vector<Status>{Status::PENDING, Status::PENDING, Status::SENT, Status::PERSISTED, Status::SENT,
                                    Status::PERSISTED}),
               statuses);
@@ -157,14 +157,14 @@ TEST_F(DeltaHandlerTest, StatusFollowsLeastAdvancedQueuedDeltaWhateverTheOrderOf
     report(reportedFirst, Status::PERSISTED);
     deliver({echo(reportedFirst, 2)});
     EXPECT_EQ(3, object("a:b", "r").first);
-    EXPECT_EQ(9u, receivedDeltas().size());  // PENDING, PERSISTED (status), PERSISTED (echo)
+    EXPECT_EQ(9u, heard.all().size());  // PENDING, PERSISTED (status), PERSISTED (echo)
 
     Delta remove{"", "a:b", 0, "k", "", ts::SyncProtocol::DeltaType::DELETE, {}, 0};
     remove.versionId = deltaHandler->addLocalDeltaWithNextVersionId(remove);
     report(remove, Status::SENT);
     EXPECT_EQ(0, object("a:b", "k").first);
-    EXPECT_EQ(Status::SENT, receivedDeltas().back().status);
-    EXPECT_EQ(ts::SyncProtocol::DeltaType::DELETE, receivedDeltas().back().type);
+    EXPECT_EQ(Status::SENT, heard.all().back().status);
+    EXPECT_EQ(ts::SyncProtocol::DeltaType::DELETE, heard.all().back().type);
 }
 
 TEST_F(DeltaHandlerTest, StoppedHandlerRefusesWritesAndDropsEvents) {
@@ -179,7 +179,7 @@ TEST_F(DeltaHandlerTest, StoppedHandlerRefusesWritesAndDropsEvents) {
     EXPECT_EQ(before + 1, versionIdGenerator->queryVersionId("a:b"));  // the id is used up
     deliver({testsupport::remoteDelta("a:b", "k", 1)});
     EXPECT_EQ(0, object("a:b", "k").first);
-    EXPECT_TRUE(receivedDeltas().empty());
+    EXPECT_TRUE(heard.all().empty());
 }
 
 TEST_F(DeltaHandlerTest, CallbacksSurviveThrowingAndEmptyCallbacksAndBadNumbers) {

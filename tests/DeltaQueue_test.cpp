@@ -29,7 +29,7 @@ protected:
             listened.push_back(delta.primaryKey + ":" + std::to_string(static_cast<int>(status)));
         });
     }
-    std::vector<std::string> heard() {
+    std::vector<std::string> statusesHeard() {
         std::lock_guard<std::mutex> lock(listenedMutex);
         return listened;
     }
@@ -49,16 +49,16 @@ TEST_F(DeltaQueueTest, StatusUpdatesChangeRowsOnWorkerAndReachListenersOnlyOnCha
     report(unknown, Status::SENT);  // not queued
     drainJobs();
     EXPECT_EQ(Status::SENT, deltaQueueStorage->getDeltaStatus(delta).value());
-    EXPECT_EQ(std::vector<std::string>{"k:2"}, heard());
+    EXPECT_EQ(std::vector<std::string>{"k:2"}, statusesHeard());
 
     report(delta, Status::PERSISTED);
     drainJobs();
     EXPECT_FALSE(deltaQueueStorage->getDeltaStatus(delta).has_value());
-    EXPECT_EQ((std::vector<std::string>{"k:2", "k:3"}), heard());
+    EXPECT_EQ((std::vector<std::string>{"k:2", "k:3"}), statusesHeard());
     report(delta, Status::PERSISTED);  // the row is gone: nothing more
     report(delta, static_cast<Status>(7));  // unknown status: dropped, never stored
     drainJobs();
-    EXPECT_EQ(2u, heard().size());
+    EXPECT_EQ(2u, statusesHeard().size());
 }
 
 TEST_F(DeltaQueueTest, ConnectionResendsWholeQueueOldestFirstUntilStopped) {
@@ -128,7 +128,7 @@ TEST_F(FlakyDeltaQueueTest, FailedStatusTransactionRollsBackAndIsRetried) {
     drainJobs();
     EXPECT_EQ(2u, log.linesStartingWith("Failed to process delta status update").size());
     EXPECT_EQ(Status::SENT, deltaQueueStorage->getDeltaStatus(delta).value());
-    EXPECT_EQ(std::vector<std::string>{"k:2"}, heard());  // once, after the successful attempt
+    EXPECT_EQ(std::vector<std::string>{"k:2"}, statusesHeard());  // once, after the successful attempt
 }
 
 using DeltaQueueDeathTest = DeltaQueueTest;

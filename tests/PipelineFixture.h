@@ -7,11 +7,11 @@
 
 #include <chrono>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include "FakeTransport.h"
+#include "StoreTestSupport.h"
 #include "TestSupport.h"
 #include "sqlite/Database.h"
 #include "tessarine/CallbackManager.h"
@@ -48,10 +48,7 @@ protected:
         using std::chrono::milliseconds;
         components() = ts::buildStoreComponents(transport, threadCreator, database, deltaQueueStorage,
                                                 {milliseconds(1), milliseconds(20), 2, milliseconds(1)});
-        callbackManager->addDeltaReceivedCallback([this](const std::vector<ts::Delta>& deltas) {
-            std::lock_guard<std::mutex> lock(receivedMutex);
-            for (const auto& d : deltas) received.push_back(d);
-        });
+        callbackManager->addDeltaReceivedCallback([this](const std::vector<ts::Delta>& deltas) { heard.add(deltas); });
     }
 
     // Releases the components in the store's destruction order.
@@ -85,19 +82,13 @@ protected:
         ASSERT_TRUE(waitUntil([&] { return done.load(); }));
     }
 
-    std::vector<ts::Delta> receivedDeltas() {
-        std::lock_guard<std::mutex> lock(receivedMutex);
-        return received;
-    }
-
     ts::StoreComponents& components() { return *this; }
 
     TempDir dir;
     std::string path = dir.file("store.db");
     std::shared_ptr<FakeTransport> transport = std::make_shared<FakeTransport>();
     std::shared_ptr<CountingThreadCreator> threadCreator = std::make_shared<CountingThreadCreator>();
-    std::mutex receivedMutex;
-    std::vector<ts::Delta> received;
+    HeardDeltas heard;  // every change reported to the application, in order
 };
 
 }  // namespace testsupport
