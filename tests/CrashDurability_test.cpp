@@ -26,8 +26,9 @@ constexpr int kCycles = 60;
 #endif
 const char* const kCollections[] = {"crash:notes", "crash:tasks", "crash:remote"};
 
-// The same change as the store resends it: version id aside, all but the
-// client id and sequence number, which a resend sets itself.
+// Whether two changes agree in what a resend carries over from the queue;
+// the version id is compared apart, client id and sequence number are the
+// resend's own.
 bool sameChange(const Delta& a, const Delta& b) {
     return a.collectionName == b.collectionName && a.primaryKey == b.primaryKey && a.type == b.type &&
            a.sortKey == b.sortKey && a.blob == b.blob;
