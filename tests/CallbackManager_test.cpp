@@ -19,29 +19,10 @@ CallbackManager::CollectionIndexerFunction indexerReturning(const std::string& t
     };
 }
 
-TEST(CallbackManagerTest, CopiesKeepRegistrationOrderAndDoNotSeeLaterChanges) {
-    CallbackManager manager;
-    std::vector<int> calls;
-    auto first = [&](const std::vector<Delta>&) { calls.push_back(1); };
-    manager.addDeltaReceivedCallback(first);
-    manager.addDeltaReceivedCallback([&](const std::vector<Delta>&) { calls.push_back(2); });
-    manager.addDeltaReceivedCallback(first);
-    auto copy = manager.getDeltaReceivedCallbacks();
-    manager.addDeltaReceivedCallback([&](const std::vector<Delta>&) { calls.push_back(3); });
-    for (const auto& callback : copy) callback({});
-    EXPECT_EQ((std::vector<int>{1, 2, 1}), calls);
-
-    manager.setCollectionIndexerFunction(indexerReturning("old"));
-    auto oldIndexer = manager.getCollectionIndexerFunction();
-    manager.setCollectionIndexerFunction(nullptr);
-    EXPECT_FALSE(manager.getCollectionIndexerFunction());
-    EXPECT_EQ(1u, oldIndexer("a:b", "pk", "sk", {}).count("old"));  // the copy outlives its replacement
-}
-
 // Registration while the store runs must be safe: a writer thread adds
 // callbacks and swaps indexers while this thread keeps reading. In the
 // sanitizer build a use of a released function fails the test.
-TEST(CallbackManagerTest, RegistrationFromAnotherThreadDuringReadsIsSafe) {
+TEST(CallbackManagerTest, RegistrationFromAnotherThreadDuringReadsIsSafeAndCopiesDoNotSeeLaterChanges) {
     CallbackManager manager;
     constexpr int kAdds = 2000;
     std::atomic<bool> writerDone{false};
@@ -66,6 +47,25 @@ TEST(CallbackManagerTest, RegistrationFromAnotherThreadDuringReadsIsSafe) {
     writer.join();
     EXPECT_EQ(static_cast<size_t>(kAdds), lastSize);
     EXPECT_EQ(1u, manager.getCollectionIndexerFunction()("a:b", "p", "s", {}).count("field1999"));
+
+    // A copy keeps the registration order and does not see later changes;
+    // a copied indexer outlives its replacement.
+    CallbackManager fresh;
+    std::vector<int> calls;
+    auto first = [&](const std::vector<Delta>&) { calls.push_back(1); };
+    fresh.addDeltaReceivedCallback(first);
+    fresh.addDeltaReceivedCallback([&](const std::vector<Delta>&) { calls.push_back(2); });
+    fresh.addDeltaReceivedCallback(first);
+    fresh.addDeltaReceivedCallback([&](const std::vector<Delta>&) { calls.push_back(4); });
+    auto copy = fresh.getDeltaReceivedCallbacks();
+    fresh.addDeltaReceivedCallback([&](const std::vector<Delta>&) { calls.push_back(3); });
+    for (const auto& callback : copy) callback({});
+    EXPECT_EQ((std::vector<int>{1, 2, 1, 4}), calls);
+    fresh.setCollectionIndexerFunction(indexerReturning("old"));
+    auto oldIndexer = fresh.getCollectionIndexerFunction();
+    fresh.setCollectionIndexerFunction(nullptr);
+    EXPECT_FALSE(fresh.getCollectionIndexerFunction());
+    EXPECT_EQ(1u, oldIndexer("a:b", "pk", "sk", {}).count("old"));
 }
 
 }  // namespace

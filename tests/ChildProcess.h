@@ -1,22 +1,24 @@
-// Runs a helper program of the test suite as a separate process, for tests
-// that must kill a store abruptly or run it with other rights. Uses
-// posix_spawn, which is safe in a test process that runs threads (a bare fork
-// is not, under ThreadSanitizer). The child shares the test's standard output
-// and error, so whatever a sanitizer reports in it shows in the test's log.
+// Runs a helper program of the test suite (or a broker, a database server) as
+// a separate process, for tests that must kill a store abruptly or run it
+// with other rights. Between fork and exec the child only makes
+// async-signal-safe calls, as a process that runs threads requires. The
+// child is killed when the thread that started it ends, so a test that
+// crashes leaves no server behind (credential-changing programs such as
+// runuser drop that). It shares the test's standard output and error, so
+// whatever a sanitizer reports in it shows in the test's log.
 #pragma once
 
 #include <signal.h>
-#include <spawn.h>
+#include <sys/prctl.h>
 #include <sys/types.h>
 #include <sys/wait.h>
+#include <unistd.h>
 
 #include <cerrno>
 #include <sstream>
 #include <stdexcept>
 #include <string>
 #include <vector>
-
-extern char** environ;
 
 namespace testsupport {
 
@@ -35,8 +37,15 @@ public:
         std::vector<char*> argv;
         for (std::string& argument : all) argv.push_back(argument.data());
         argv.push_back(nullptr);
-        int rc = posix_spawnp(&pid, argv[0], nullptr, nullptr, argv.data(), environ);
-        if (rc != 0) throw std::runtime_error("cannot start " + all[0] + ": error " + std::to_string(rc));
+        const pid_t parent = getpid();
+        pid = fork();
+        if (pid < 0) throw std::runtime_error("cannot start " + all[0] + ": error " + std::to_string(errno));
+        if (pid == 0) {
+            // The parent may have ended before the signal was asked for.
+            if (prctl(PR_SET_PDEATHSIG, SIGKILL) != 0 || getppid() != parent) _exit(126);
+            execvp(argv[0], argv.data());
+            _exit(127);
+        }
     }
 
     // A child still running when the object goes is killed and reaped.

@@ -44,7 +44,9 @@ protected:
 
 TEST_F(DeliveryRecoveryTest, ChangeForUnsubscribedCollectionWaitsForSubscriptionThenEverythingAppliesInOrder) {
     LogCapture log;
-    s.transport->onDeltaReceived({remoteDelta("app:later", "x", 5, {1})});  // no tables for app:later yet
+    // A delivery applies whole or not at all: w waits with x, which has no
+    // table until app:later is subscribed.
+    s.transport->onDeltaReceived({remoteDelta("app:known", "w", 4, {3}), remoteDelta("app:later", "x", 5, {1})});
     s.transport->onDeltaReceived({remoteDelta("app:known", "y", 6, {1})});
     s.transport->onDeltaReceived({remoteDelta("app:known", "y", 7, {2})});
     // Local writes do not wait for the worker; their status notices do.
@@ -65,12 +67,13 @@ TEST_F(DeliveryRecoveryTest, ChangeForUnsubscribedCollectionWaitsForSubscription
 
     auto later = s.store->subscribeCollection("app:later");
     ASSERT_TRUE(later);
-    ASSERT_TRUE(waitUntil([&] { return heardSoFar().size() == 5; }));
-    EXPECT_EQ((std::vector<std::string>{"app:known/z:9:1", "app:later/x:1:3", "app:known/y:1:3", "app:known/y:2:3",
-                                        "app:known/z:9:2"}),
+    ASSERT_TRUE(waitUntil([&] { return heardSoFar().size() == 6; }));
+    EXPECT_EQ((std::vector<std::string>{"app:known/z:9:1", "app:known/w:3:3", "app:later/x:1:3", "app:known/y:1:3",
+                                        "app:known/y:2:3", "app:known/z:9:2"}),
               heardSoFar());
     EXPECT_EQ((std::vector<std::string>{"x=x:3:1"}), rows(later->query("", -1, Direction::ASCENDING)));
-    EXPECT_EQ((std::vector<std::string>{"y=y:3:1", "z=z:2:1"}), rows(known->query("", -1, Direction::ASCENDING)));
+    EXPECT_EQ((std::vector<std::string>{"w=w:3:1", "y=y:3:1", "z=z:2:1"}),
+              rows(known->query("", -1, Direction::ASCENDING)));
     ASSERT_TRUE(waitUntil([&] { return s.store->getSyncMetrics()->waitingJobs == 0; }));
     auto recovered = s.store->getSyncMetrics();
     EXPECT_FALSE(recovered->retrying);

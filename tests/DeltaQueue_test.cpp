@@ -5,7 +5,6 @@
 namespace {
 
 using testsupport::LogCapture;
-using testsupport::waitUntil;
 namespace ts = lumivale::tessarine;
 
 // Fails its first `failures` status writes, as a busy or broken database would.
@@ -30,7 +29,7 @@ protected:
             listened.push_back(delta.primaryKey + ":" + std::to_string(static_cast<int>(status)));
         });
     }
-    std::vector<std::string> heard() {
+    std::vector<std::string> statusesHeard() {
         std::lock_guard<std::mutex> lock(listenedMutex);
         return listened;
     }
@@ -39,21 +38,6 @@ protected:
     std::mutex listenedMutex;
     std::vector<std::string> listened;
 };
-
-TEST_F(DeltaQueueTest, AddDeltaQueuesRowAndOnlyACommittedOneIsSentStamped) {
-    Delta delta = remoteSave("a:b", "k", 0);
-    delta.clientId = "";
-    delta.versionId = 4;
-    const int64_t queueId = deltaQueue->addDelta(delta, Status::PENDING);
-    EXPECT_TRUE(transport->sentDeltas().empty());
-    deltaQueue->addCommitted(queueId, delta);
-    deltaQueue->sendCommitted();
-    auto sent = transport->sentDeltas();
-    ASSERT_EQ(1u, sent.size());
-    EXPECT_EQ(clientId, sent[0].clientId);
-    EXPECT_EQ(4u, sent[0].versionId);
-    EXPECT_EQ(Status::PENDING, deltaQueueStorage->getDeltaStatus(delta).value());
-}
 
 TEST_F(DeltaQueueTest, StatusUpdatesChangeRowsOnWorkerAndReachListenersOnlyOnChange) {
     listen();
@@ -65,16 +49,16 @@ TEST_F(DeltaQueueTest, StatusUpdatesChangeRowsOnWorkerAndReachListenersOnlyOnCha
     report(unknown, Status::SENT);  // not queued
     drainJobs();
     EXPECT_EQ(Status::SENT, deltaQueueStorage->getDeltaStatus(delta).value());
-    EXPECT_EQ(std::vector<std::string>{"k:2"}, heard());
+    EXPECT_EQ(std::vector<std::string>{"k:2"}, statusesHeard());
 
     report(delta, Status::PERSISTED);
     drainJobs();
     EXPECT_FALSE(deltaQueueStorage->getDeltaStatus(delta).has_value());
-    EXPECT_EQ((std::vector<std::string>{"k:2", "k:3"}), heard());
+    EXPECT_EQ((std::vector<std::string>{"k:2", "k:3"}), statusesHeard());
     report(delta, Status::PERSISTED);  // the row is gone: nothing more
     report(delta, static_cast<Status>(7));  // unknown status: dropped, never stored
     drainJobs();
-    EXPECT_EQ(2u, heard().size());
+    EXPECT_EQ(2u, statusesHeard().size());
 }
 
 TEST_F(DeltaQueueTest, ConnectionResendsWholeQueueOldestFirstUntilStopped) {
@@ -144,7 +128,14 @@ TEST_F(FlakyDeltaQueueTest, FailedStatusTransactionRollsBackAndIsRetried) {
     drainJobs();
     EXPECT_EQ(2u, log.linesStartingWith("Failed to process delta status update").size());
     EXPECT_EQ(Status::SENT, deltaQueueStorage->getDeltaStatus(delta).value());
-    EXPECT_EQ(std::vector<std::string>{"k:2"}, heard());  // once, after the successful attempt
+    EXPECT_EQ(std::vector<std::string>{"k:2"}, statusesHeard());  // once, after the successful attempt
+}
+
+using DeltaQueueDeathTest = DeltaQueueTest;
+
+TEST_F(DeltaQueueDeathTest, StoringPersistedIsABrokenInvariant) {
+    EXPECT_DEATH(deltaQueueStorage->updateDeltaStatus(localSave("a:b", "k"), Status::PERSISTED),
+                 "Assert \\(DeltaQueueStorage:[0-9]+\\): Deltas with status=PERSISTED should be deleted from the queue");
 }
 
 }  // namespace

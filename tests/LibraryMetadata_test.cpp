@@ -53,13 +53,6 @@ TEST(LibraryMetadataTest, FreshDatabaseGetsTimestampedIdThatReopeningKeeps) {
     EXPECT_NE(id, open(dir.file("b.db"))->getClientUuid());
 }
 
-TEST(LibraryMetadataTest, RandomFieldsArePaddedHexOfTheDraws) {
-    auto storage = std::make_shared<LibraryMetadataStorage>(
-        std::make_shared<lumivale::sqlite::Database>(":memory:", kOpenReadWriteCreate));
-    FixedRandomMetadata metadata(storage);
-    EXPECT_EQ("0000000000000001000000FF", metadata.generateClientUuid().substr(8));
-}
-
 TEST(LibraryMetadataTest, StoredVersionDecidesUpdateAndExistingRowsAreNeverReplaced) {
     auto db = std::make_shared<lumivale::sqlite::Database>(":memory:", kOpenReadWriteCreate);
     auto storage = std::make_shared<LibraryMetadataStorage>(db);
@@ -79,4 +72,6 @@ TEST(LibraryMetadataTest, StoredVersionDecidesUpdateAndExistingRowsAreNeverRepla
     EXPECT_FALSE(metadata.needsUpdate());
     storage->setString("version", "  42abc");
     EXPECT_EQ(42, storage->getInt64("version"));
+    // The random fields of a new id: padded hex of the draws.
+    EXPECT_EQ("0000000000000001000000FF", FixedRandomMetadata(storage).generateClientUuid().substr(8));
 }

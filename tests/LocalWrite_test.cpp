@@ -6,7 +6,6 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <map>
 #include <string>
 #include <thread>
 #include <vector>
@@ -15,7 +14,6 @@
 
 #include "FaultyVfs.h"
 #include "StoreTestSupport.h"
-#include "Watchdog.h"
 
 namespace {
 
@@ -31,31 +29,18 @@ const char* const kRefusedWrite =
 
 class LocalWriteTest : public ::testing::Test {
 protected:
-    // Writes into "app:others" on a thread of its own until destroyed.
-    class BackgroundWriter {
-    public:
-        explicit BackgroundWriter(ts::Collection& collection)
-            : thread([this, &collection] {
-                  for (int i = 0; !stop; ++i) {
-                      if (collection.saveObject("bg-" + std::to_string(i), "s", Bytes{1})) ++written;
-                  }
-              }) {}
-        ~BackgroundWriter() {
-            waitUntil([this] { return written.load() > 0; });
-            stop = true;
-            thread.join();
-        }
-
-    private:
-        std::atomic<bool> stop{false};
-        std::atomic<int> written{0};
-        std::thread thread;
-    };
-
+    // Runs body under a watchdog while another thread writes into "app:others".
     void withWriterAndWatchdog(const std::function<void()>& body) {
         testsupport::runWithWatchdog("a write from code the store calls", std::chrono::seconds(60), [&] {
-            BackgroundWriter writer(*others);
+            std::atomic<bool> stop{false};
+            std::atomic<int> written{0};
+            std::thread writer([&] {
+                for (int i = 0; !stop; ++i) written += others->saveObject("bg-" + std::to_string(i), "s", Bytes{1});
+            });
             body();
+            waitUntil([&] { return written.load() > 0; });
+            stop = true;
+            writer.join();
         });
     }
 

@@ -9,15 +9,7 @@
 #include "platform/Assert.h"
 #include "platform/Log.h"
 
-TEST(LogTest, DefaultWritesOneLetterTaggedLineToStandardError) {
-    testing::internal::CaptureStderr();
-    lv_printLog(5, "tessarine", "value %d of %s", 42, "x");
-    lv_printLog(2, "t", "verbose");
-    lv_printLog(7, "t", "fatal");
-    EXPECT_EQ("W/tessarine: value 42 of x\nV/t: verbose\nF/t: fatal\n", testing::internal::GetCapturedStderr());
-}
-
-TEST(LogTest, SinkSeesEveryWholeLineFromSeveralThreadsUntilRemoved) {
+TEST(LogTest, SinkSeesEveryWholeLineFromSeveralThreadsThenStandardErrorGetsOneLetterTaggedLines) {
     constexpr int kThreads = 4;
     constexpr int kLines = 200;
     std::set<std::string> messages;
@@ -39,9 +31,14 @@ TEST(LogTest, SinkSeesEveryWholeLineFromSeveralThreadsUntilRemoved) {
     EXPECT_EQ(static_cast<size_t>(kThreads * kLines), messages.size());
     EXPECT_EQ(1u, messages.count("thread 3 line 199"));
 
+    // Without a sink: standard error, one letter for the priority.
     testing::internal::CaptureStderr();
     lv_printLog(4, "tag", "back to stderr");
-    EXPECT_EQ("I/tag: back to stderr\n", testing::internal::GetCapturedStderr());
+    lv_printLog(5, "tessarine", "value %d of %s", 42, "x");
+    lv_printLog(2, "t", "verbose");
+    lv_printLog(7, "t", "fatal");
+    EXPECT_EQ("I/tag: back to stderr\nW/tessarine: value 42 of x\nV/t: verbose\nF/t: fatal\n",
+              testing::internal::GetCapturedStderr());
 }
 
 TEST(LogDeathTest, AssertInternalLogsFatalAndAborts) {

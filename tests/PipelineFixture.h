@@ -7,11 +7,11 @@
 
 #include <chrono>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
 #include "FakeTransport.h"
+#include "StoreTestSupport.h"
 #include "TestSupport.h"
 #include "sqlite/Database.h"
 #include "tessarine/CallbackManager.h"
@@ -48,16 +48,11 @@ protected:
         using std::chrono::milliseconds;
         components() = ts::buildStoreComponents(transport, threadCreator, database, deltaQueueStorage,
                                                 {milliseconds(1), milliseconds(20), 2, milliseconds(1)});
-        callbackManager->addDeltaReceivedCallback([this](const std::vector<ts::Delta>& deltas) {
-            std::lock_guard<std::mutex> lock(receivedMutex);
-            for (const auto& d : deltas) received.push_back(d);
-        });
+        callbackManager->addDeltaReceivedCallback([this](const std::vector<ts::Delta>& deltas) { heard.add(deltas); });
     }
 
     // Releases the components in the store's destruction order.
-    void tearDownComponents() { ts::StoreComponents released(std::move(components())); }
-
-    void TearDown() override { tearDownComponents(); }
+    void TearDown() override { ts::StoreComponents released(std::move(components())); }
 
     // A local write as a collection handle makes it.
     Delta localSave(const std::string& collection, const std::string& key, std::vector<unsigned char> blob = {7}) {
@@ -70,11 +65,6 @@ protected:
         delta.blob = std::move(blob);
         delta.versionId = deltaHandler->addLocalDeltaWithNextVersionId(delta);
         return delta;
-    }
-
-    static Delta remoteSave(const std::string& collection, const std::string& key, uint64_t sequenceNumber,
-                            std::vector<unsigned char> blob = {9}) {
-        return remoteDelta(collection, key, sequenceNumber, std::move(blob));
     }
 
     // Status and blob of an object, or status 0 when it has no row.
@@ -92,19 +82,13 @@ protected:
         ASSERT_TRUE(waitUntil([&] { return done.load(); }));
     }
 
-    std::vector<ts::Delta> receivedDeltas() {
-        std::lock_guard<std::mutex> lock(receivedMutex);
-        return received;
-    }
-
     ts::StoreComponents& components() { return *this; }
 
     TempDir dir;
     std::string path = dir.file("store.db");
     std::shared_ptr<FakeTransport> transport = std::make_shared<FakeTransport>();
     std::shared_ptr<CountingThreadCreator> threadCreator = std::make_shared<CountingThreadCreator>();
-    std::mutex receivedMutex;
-    std::vector<ts::Delta> received;
+    HeardDeltas heard;  // every change reported to the application, in order
 };
 
 }  // namespace testsupport

@@ -178,6 +178,13 @@ TEST(ProtocolTest, DeltasReadBackWithTheListsSequenceNumberStringsCutAtZeroAndTh
         EXPECT_EQ(version, protocol::makeTessarineDelta(serverDelta("a:b", "pk", 0, writer, versions), 0).versionId)
             << (writer ? writer : "no writer");
     }
+    // 64 bits on every ABI: these fail where a value passes through a 32-bit
+    // type (long or size_t on armeabi-v7a, the armhf configuration).
+    for (uint64_t wide : std::vector<uint64_t>{1ull << 32, (0xFFFFFFFFull << 16) + 7, (1ull << 63) + 1, UINT64_MAX}) {
+        SyncProtocol::Delta delta{"", "a:b", wide, "pk", "", DeltaType::SAVE, {}, 0};
+        SyncProtocol::Delta read = protocol::makeTessarineDelta(protocol::makePayloadForSendDelta(delta), wide - 1);
+        EXPECT_EQ(std::make_pair(wide, wide - 1), std::make_pair(read.versionId, read.sequenceNumber));
+    }
 }
 
 TEST(ProtocolTest, SnapshotsAndPayloadsKeepObjectOrderAndBytesWhole) {

@@ -61,16 +61,9 @@ Job job(std::shared_ptr<Log> log, const std::string& name, int failures = 0, Fai
     }};
 }
 
-// Destroys queue on another thread; false if that has not ended within the
-// deadline, so a hang fails the test instead of hanging it.
-bool destroyedPromptly(std::unique_ptr<SerializedJobQueue> queue) {
-    auto done = std::make_shared<std::promise<void>>();
-    std::future<void> finished = done->get_future();
-    std::thread([done](std::unique_ptr<SerializedJobQueue> owned) {
-        owned.reset();
-        done->set_value();
-    }, std::move(queue)).detach();
-    return finished.wait_for(std::chrono::seconds(20)) == std::future_status::ready;
+// Destroys queue; a destruction that hangs aborts the run.
+void destroyPromptly(std::unique_ptr<SerializedJobQueue> queue) {
+    testsupport::runWithWatchdog("destroying a job queue", std::chrono::seconds(20), [&] { queue.reset(); });
 }
 
 }  // namespace
@@ -155,16 +148,16 @@ TEST(SerializedJobQueueTest, StopWaitsForTheRunningAttemptThenNothingRunsAndDest
     stopper.join();
     queue->stopProcessingJobs();  // harmless
     queue->addJob(job(log, "after stop"));
-    EXPECT_TRUE(destroyedPromptly(std::move(queue)));
+    destroyPromptly(std::move(queue));
     EXPECT_EQ((Events{"running", "stopping", "finished", "stopped"}), log->waitFor(4));
 
-    EXPECT_TRUE(destroyedPromptly(makeQueue()));  // idle worker
+    destroyPromptly(makeQueue());  // idle worker
     auto abandoned = std::make_shared<Log>();
     auto pausing = makeQueue(backoff(ms(3600000), 2, ms(3600000)));
     pausing->addJob(job(abandoned, "A", 1000));
     pausing->addJob(job(abandoned, "B"));
     abandoned->waitFor(1);
-    EXPECT_TRUE(destroyedPromptly(std::move(pausing)));  // ends the hour's pause
+    destroyPromptly(std::move(pausing));  // ends the hour's pause
     EXPECT_EQ((Events{"A1"}), abandoned->waitFor(1));
 }
 

@@ -87,7 +87,7 @@ TEST_F(SnapshotTest, GeneratedSnapshotListsObjectsInSortOrderWithNumbers) {
     EXPECT_EQ(0u, unsubscribed.sequenceNumber);
     EXPECT_TRUE(unsubscribed.objects.empty());
 
-    transport->onDeltaReceived({remoteSave("a:b", "b", 4, {2}), remoteSave("a:b", "a", 7, {1})});
+    transport->onDeltaReceived({testsupport::remoteDelta("a:b", "b", 4, {2}), testsupport::remoteDelta("a:b", "a", 7, {1})});
     drainJobs();
     auto snapshot = generator.generateSnapshot("a:b", "OTHERCLIENT");
     EXPECT_EQ("a:b", snapshot.collectionName);
@@ -97,23 +97,6 @@ TEST_F(SnapshotTest, GeneratedSnapshotListsObjectsInSortOrderWithNumbers) {
     EXPECT_EQ("a", snapshot.objects[0].primaryKey);  // sort keys a < b
     EXPECT_EQ(std::vector<unsigned char>{1}, snapshot.objects[0].blob);
     EXPECT_EQ(0u, generator.generateSnapshot("a:b", "NOBODY").versionId);
-}
-
-TEST(VersionVectorStorageTest, KeepsHighestUnsignedVersionPerCollectionAndClient) {
-    testsupport::TempDir dir;
-    {
-        ts::VersionVectorStorage storage(ts::Tessarine::createSqliteDatabase(dir.file("v.db"), {}));
-        storage.updateCollectionVersionVector("a:b", "C1", 5);
-        storage.updateCollectionVersionVector("a:b", "C1", 3);
-        storage.updateCollectionVersionVector("a:b", "C2", UINT64_MAX - 1);
-        storage.updateCollectionVersionVector("a:b", "C2", 9);
-        storage.updateCollectionVersionVector("x:y", "C1", 1);
-    }
-    ts::VersionVectorStorage storage(ts::Tessarine::createSqliteDatabase(dir.file("v.db"), {}));
-    EXPECT_EQ(5u, storage.getCollectionVersion("a:b", "C1"));
-    EXPECT_EQ(UINT64_MAX - 1, storage.getCollectionVersion("a:b", "C2"));
-    EXPECT_EQ(1u, storage.getCollectionVersion("x:y", "C1"));
-    EXPECT_EQ(0u, storage.getCollectionVersion("x:y", "C2"));
 }
 
 }  // namespace

@@ -21,36 +21,6 @@ std::string pragma(Database& db, const std::string& name) {
     return s.step() ? s(0).getText() : "";
 }
 
-void touch(const std::string& path) { std::ofstream(path) << "x"; }
-
-}  // namespace
-
-TEST(StoreDatabaseTest, StoreTuningIsInEffect) {
-    testsupport::TempDir dir;
-    auto db = Tessarine::createSqliteDatabase(dir.file("store.db"), TessarineOptions());
-    EXPECT_EQ("2", pragma(*db, "temp_store"));  // MEMORY
-    EXPECT_EQ("wal", pragma(*db, "journal_mode"));
-    EXPECT_EQ("1", pragma(*db, "synchronous"));  // NORMAL
-    EXPECT_EQ("1000", pragma(*db, "busy_timeout"));
-
-    TessarineOptions other;
-    other.synchronous = "FULL";
-    other.busyTimeout = 250;
-    auto second = Tessarine::createSqliteDatabase(dir.file("other.db"), other);
-    EXPECT_EQ("2", pragma(*second, "synchronous"));
-    EXPECT_EQ("250", pragma(*second, "busy_timeout"));
-}
-
-TEST(StoreDatabaseTest, OpeningFailuresThrow) {
-    testsupport::TempDir dir;
-    EXPECT_THROW(Tessarine::createSqliteDatabase(dir.file("missing/store.db"), TessarineOptions()), SQLiteException);
-    TessarineOptions bad;
-    bad.journalMode = "WAL; DROP";
-    EXPECT_THROW(Tessarine::createSqliteDatabase(dir.file("bad.db"), bad), SQLiteException);
-}
-
-namespace {
-
 // A store whose file walk uses path while its tables live in db, so that the
 // walk can be tested on files that are not databases.
 std::unique_ptr<Tessarine> storeOver(std::shared_ptr<Database> db, const std::string& path) {
@@ -65,40 +35,46 @@ std::unique_ptr<Tessarine> openStore(const std::string& path) {
 
 }  // namespace
 
-TEST(StoreDatabaseTest, RemoveWithoutFilesReturnsTrue) {
-    for (const std::string path : {"", ":memory:"}) {
-        auto store = openStore(path);
-        ASSERT_TRUE(store);
-        EXPECT_TRUE(store->remove());
-        EXPECT_TRUE(store->remove());
-    }
+TEST(StoreDatabaseTest, StoreTuningIsInEffectAndOpeningFailuresThrow) {
+    testsupport::TempDir dir;
+    auto db = Tessarine::createSqliteDatabase(dir.file("store.db"), TessarineOptions());
+    EXPECT_EQ("2", pragma(*db, "temp_store"));  // MEMORY
+    EXPECT_EQ("wal", pragma(*db, "journal_mode"));
+    EXPECT_EQ("1", pragma(*db, "synchronous"));  // NORMAL
+    EXPECT_EQ("1000", pragma(*db, "busy_timeout"));
+
+    TessarineOptions other;
+    other.synchronous = "FULL";
+    other.busyTimeout = 250;
+    auto second = Tessarine::createSqliteDatabase(dir.file("other.db"), other);
+    EXPECT_EQ("2", pragma(*second, "synchronous"));
+    EXPECT_EQ("250", pragma(*second, "busy_timeout"));
+
+    EXPECT_THROW(Tessarine::createSqliteDatabase(dir.file("missing/store.db"), TessarineOptions()), SQLiteException);
+    other.journalMode = "WAL; DROP";
+    EXPECT_THROW(Tessarine::createSqliteDatabase(dir.file("bad.db"), other), SQLiteException);
 }
 
 TEST(StoreDatabaseTest, RemoveStopsTheStoreAndDeletesDatabaseAndCompanions) {
+    for (const std::string path : {"", ":memory:"}) {  // no files: nothing to delete, twice
+        auto store = openStore(path);
+        ASSERT_TRUE(store && store->remove() && store->remove()) << path;
+    }
     testsupport::TempDir dir;
     const std::string path = dir.file("store.db");
     auto store = openStore(path);
     auto items = store->subscribeCollection("app:items");
     ASSERT_TRUE(items->saveObject("k", "s", std::vector<unsigned char>{1}));
-    ASSERT_TRUE(Tessarine::fileExists(path + "-wal"));
-    ASSERT_TRUE(Tessarine::fileExists(path + "-shm"));
-
+    ASSERT_TRUE(Tessarine::fileExists(path + "-wal") && Tessarine::fileExists(path + "-shm"));
     EXPECT_TRUE(store->remove());
-    EXPECT_FALSE(Tessarine::fileExists(path));
-    EXPECT_FALSE(Tessarine::fileExists(path + "-wal"));
-    EXPECT_FALSE(Tessarine::fileExists(path + "-shm"));
+    for (const char* suffix : {"", "-wal", "-shm"}) EXPECT_FALSE(Tessarine::fileExists(path + suffix)) << suffix;
     testsupport::LogCapture log;
     EXPECT_FALSE(items->saveObject("k2", "s", std::vector<unsigned char>{2}));
     EXPECT_EQ(1u, log.linesStartingWith("Error while updating object: DeltaHandler already stopped").size());
     EXPECT_TRUE(store->remove());  // nothing left to delete
-}
 
-TEST(StoreDatabaseTest, RemoveWithoutCompanionFilesDeletesOnlyTheDatabase) {
-    testsupport::TempDir dir;
-    const std::string path = dir.file("store.db");
+    // Without companion files only the database goes.
     Database(path, kOpenReadWriteCreate).exec("CREATE TABLE t (x)");  // closed again: no -wal, no -shm
-    ASSERT_TRUE(Tessarine::fileExists(path));
-    ASSERT_FALSE(Tessarine::fileExists(path + "-wal"));
     EXPECT_TRUE(storeOver(std::make_shared<Database>(":memory:", kOpenReadWriteCreate), path)->remove());
     EXPECT_FALSE(Tessarine::fileExists(path));
 }
@@ -108,11 +84,8 @@ TEST(StoreDatabaseTest, RemoveStopsAtDatabaseThatCannotBeDeleted) {
     // A non-empty directory opens for reading but cannot be removed, even by root.
     const std::string path = dir.file("store.db");
     std::filesystem::create_directory(path);
-    touch(path + "/keeps-it-non-empty");
-    touch(path + "-shm");
-    touch(path + "-wal");
+    for (const char* file : {"/keeps-it-non-empty", "-shm", "-wal"}) std::ofstream(path + file) << "x";
     EXPECT_FALSE(storeOver(std::make_shared<Database>(":memory:", kOpenReadWriteCreate), path)->remove());
     EXPECT_TRUE(Tessarine::fileExists(path + "-shm"));
     EXPECT_TRUE(Tessarine::fileExists(path + "-wal"));
-    EXPECT_FALSE(Tessarine::fileExists(dir.file("never-created")));
 }

@@ -13,12 +13,10 @@
 #include <thread>
 
 #include "StoreTestSupport.h"
-#include "Watchdog.h"
 
 namespace {
 
 namespace ts = lumivale::tessarine;
-using Direction = ts::CollectionStorage::SortDirection;
 using Bytes = std::vector<unsigned char>;
 
 // A transport that only counts what it is asked to send.

@@ -22,10 +22,11 @@ namespace testsupport {
 class HeardDeltas {
 public:
     void listenTo(lumivale::tessarine::Tessarine& store) {
-        store.addDeltaReceivedCallback([this](const std::vector<lumivale::tessarine::Delta>& deltas) {
-            std::lock_guard<std::mutex> lock(mutex);
-            heard.insert(heard.end(), deltas.begin(), deltas.end());
-        });
+        store.addDeltaReceivedCallback([this](const std::vector<lumivale::tessarine::Delta>& deltas) { add(deltas); });
+    }
+    void add(const std::vector<lumivale::tessarine::Delta>& deltas) {
+        std::lock_guard<std::mutex> lock(mutex);
+        heard.insert(heard.end(), deltas.begin(), deltas.end());
     }
     std::vector<lumivale::tessarine::Delta> all() const {
         std::lock_guard<std::mutex> lock(mutex);

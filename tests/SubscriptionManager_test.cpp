@@ -11,36 +11,26 @@ protected:
     void SetUp() override { build(); }
 };
 
-TEST_F(SubscriptionManagerTest, SubscribingSendsStoredSequenceNumberWithIdentity) {
-    subscriptionManager->subscribeCollection("a:b");
-    subscriptionManager->updateSequenceNumber("a:b", 42);
-    subscriptionManager->subscribeCollection("a:b");
-    auto requests = transport->sentSubscriptions();
-    ASSERT_EQ(2u, requests.size());
-    EXPECT_EQ(0u, requests[0].sequenceNumber);
-    EXPECT_EQ(42u, requests[1].sequenceNumber);
-    for (const auto& request : requests) {
-        EXPECT_EQ("a:b", request.collectionName);
-        EXPECT_EQ(clientId, request.clientId);
-        EXPECT_EQ(std::string(1, '\x01'), request.version);
-    }
-    EXPECT_EQ(42u, subscriptionManager->getSequenceNumber("a:b"));
-}
-
 TEST_F(SubscriptionManagerTest, ConnectionResubscribesEverythingBeforeQueueResends) {
     LogCapture log;
     subscriptionManager->subscribeCollection("a:b");
     subscriptionManager->subscribeCollection("c:d");
     subscriptionManager->updateSequenceNumber("c:d", 5);
+    subscriptionManager->subscribeCollection("c:d");  // again: with the stored number
+    EXPECT_EQ(5u, transport->sentSubscriptions().back().sequenceNumber);
+    EXPECT_EQ(5u, subscriptionManager->getSequenceNumber("c:d"));
     localSave("a:b", "k");
     transport->clearSent();
-
     transport->onConnectionEstablished();
     auto events = transport->sentEvents();
     ASSERT_EQ(3u, events.size());
     EXPECT_EQ("delta a:b/1", events[2]);
     std::map<std::string, uint64_t> numbers;
-    for (const auto& request : transport->sentSubscriptions()) numbers[request.collectionName] = request.sequenceNumber;
+    for (const auto& request : transport->sentSubscriptions()) {
+        numbers[request.collectionName] = request.sequenceNumber;
+        EXPECT_EQ(clientId, request.clientId);
+        EXPECT_EQ(std::string(1, '\x01'), request.version);
+    }
     EXPECT_EQ((std::map<std::string, uint64_t>{{"a:b", 0}, {"c:d", 5}}), numbers);
     EXPECT_EQ(1u, log.linesStartingWith("SubscriptionManager::onConnectionEstablished is called back").size());
 }

@@ -1,8 +1,11 @@
 #include "TestSupport.h"
 
 #include <atomic>
+#include <cstdio>
+#include <cstdlib>
 #include <fstream>
 #include <random>
+#include <sstream>
 #include <thread>
 #include <unistd.h>
 
@@ -49,6 +52,34 @@ std::vector<LogLine> LogCapture::linesStartingWith(const std::string& prefix) co
 std::string fileContent(const std::string& path) {
     std::ifstream in(path, std::ios::binary);
     return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
+void runWithWatchdog(const char* what, std::chrono::seconds deadline, const std::function<void()>& body) {
+    std::mutex mutex;
+    std::condition_variable finished;
+    bool done = false;
+    std::thread runner([&] {
+        body();
+        std::lock_guard<std::mutex> lock(mutex);
+        done = true;
+        finished.notify_all();
+    });
+    std::unique_lock<std::mutex> lock(mutex);
+    if (!finished.wait_for(lock, deadline, [&] { return done; })) {
+        std::fprintf(stderr, "watchdog: %s did not finish within %lld s, a deadlock; aborting\n", what,
+                     static_cast<long long>(deadline.count()));
+        std::fflush(stderr);
+        std::abort();
+    }
+    lock.unlock();
+    runner.join();
+}
+
+std::vector<std::string> fileLines(const std::string& path) {
+    std::istringstream text(fileContent(path));
+    std::vector<std::string> lines;
+    for (std::string line; std::getline(text, line) && !text.eof();) lines.push_back(line);
+    return lines;
 }
 
 bool waitUntil(const std::function<bool()>& condition, std::chrono::milliseconds deadline) {

@@ -91,9 +91,7 @@ std::vector<std::string> probeReadOnly(const std::string& folder, fs::perms fold
     int status = probe.wait();
     fs::permissions(folder, fs::perms::owner_all, fs::perm_options::add);
     fs::permissions(path, fs::perms::owner_read | fs::perms::owner_write, fs::perm_options::add);
-    std::vector<std::string> lines;
-    std::ifstream in(report);
-    for (std::string line; std::getline(in, line);) lines.push_back(line);
+    std::vector<std::string> lines = testsupport::fileLines(report);
     if (!(WIFEXITED(status) && WEXITSTATUS(status) == 0)) {
         lines.push_back("probe ended with " + testsupport::describeWaitStatus(status));
     }

@@ -51,10 +51,15 @@ TEST_F(VersionIdGeneratorTest, CountersAreIndependentCaseSensitiveSurviveReopeni
     EXPECT_EQ(1u, generator->incrementAndGetVersionId("a:c"));
     EXPECT_EQ(3u, generator->incrementAndGetVersionId("a:b"));
     EXPECT_EQ(1u, generator->incrementAndGetVersionId("A:b"));
+    // Past 32 bits, also on 32-bit ABIs, and kept so across reopening.
+    db->exec("UPDATE collection_version_ids SET version_id = 4294967295 WHERE collection_name = 'A:b'");
+    EXPECT_EQ(0x100000000u, generator->incrementAndGetVersionId("A:b"));
     reopen();
     generator->initializeVersionId("a:b");  // reopening the collection keeps its counter
     EXPECT_EQ(4u, generator->incrementAndGetVersionId("a:b"));
     EXPECT_EQ(2u, generator->incrementAndGetVersionId("a:c"));
+    EXPECT_EQ(0x100000000u, generator->queryVersionId("A:b"));
+    EXPECT_EQ(0x100000001u, generator->incrementAndGetVersionId("A:b"));
     // A collection never initialised has no counter: 0, and no row is made.
     EXPECT_EQ(0u, generator->queryVersionId("never:opened"));
     EXPECT_EQ(0u, generator->incrementAndGetVersionId("never:opened"));

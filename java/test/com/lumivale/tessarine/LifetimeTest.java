@@ -41,39 +41,28 @@ public class LifetimeTest {
     }
 
     @Test
-    public void closedHandlesThrowIllegalStateAndCloseTwiceIsHarmless() {
+    public void closedHandlesThrowIllegalStateAndCloseTwiceIsHarmlessAndCollectionsOutliveTheirStore() {
         Tessarine store = openOffline("store.db");
         Collection items = store.subscribeCollection(ITEMS);
-        assertTrue(items.save("a", "1", bytes("x")));
+        store.close();
+        store.close();
+        assertThrows(IllegalStateException.class, store::start);
+        assertThrows(IllegalStateException.class, () -> store.subscribeCollection(ITEMS));
+
+        assertTrue(items.save("a", "1", bytes("x")));  // the collection keeps the store's parts alive
+        assertEquals(List.of("a=x/PENDING"), rows(items.query("", -1, SortDirection.ASCENDING)));
         Cursor cursor = items.get("a");
         assertThrows(IllegalStateException.class, cursor::getPrimaryKey);  // before next()
         assertTrue(cursor.next());
         assertEquals("a", cursor.getPrimaryKey());
         assertFalse(cursor.next());
         assertThrows(IllegalStateException.class, cursor::getBlob);  // after the end
-
         cursor.close();
         cursor.close();
         assertThrows(IllegalStateException.class, cursor::next);
         items.close();
         items.close();
         assertThrows(IllegalStateException.class, () -> items.save("b", "2", bytes("y")));
-        store.close();
-        store.close();
-        assertThrows(IllegalStateException.class, store::start);
-        assertThrows(IllegalStateException.class, () -> store.subscribeCollection(ITEMS));
-    }
-
-    @Test
-    public void aCollectionKeepsWorkingAfterItsStoreIsClosed() {
-        Collection items;
-        try (Tessarine store = openOffline("store.db")) {
-            items = store.subscribeCollection(ITEMS);
-        }
-        try (items) {
-            assertTrue(items.save("a", "1", bytes("x")));
-            assertEquals(List.of("a=x/PENDING"), rows(items.query("", -1, SortDirection.ASCENDING)));
-        }
     }
 
     // Opens a synced store, writes so that its worker calls into Java, and
