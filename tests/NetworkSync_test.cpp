@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "ChildProcess.h"
+#include "DeviceProcesses.h"
 #include "MqttBroker.h"
 #include "NatsCluster.h"
 #include "SyncDevice.h"
@@ -90,16 +91,6 @@ protected:
                                                                        "--data", dir.file("server.db")},
                                               TESSARINE_TEST_EMULATOR);
     }
-    void startDevice(const std::string& tag, int writes, int pauseMs) { startDevice(tag, writes, pauseMs, broker.port); }
-    void startDevice(const std::string& tag, int writes, int pauseMs, int brokerPort) {
-        devices.push_back(std::make_unique<ChildProcess>(
-            TESSARINE_SYNC_DEVICE,
-            std::vector<std::string>{dir.file(tag + ".db"), std::to_string(brokerPort), tag, std::to_string(writes),
-                                     std::to_string(pauseMs), dir.file(tag + ".state")},
-            TESSARINE_TEST_EMULATOR));
-        tags.push_back(tag);
-    }
-    std::vector<std::string> deviceRows(const std::string& tag) { return testsupport::fileLines(dir.file(tag + ".state")); }
     // 0 also while the server has not made its file yet.
     int64_t changesLogged() {
         try {
@@ -111,24 +102,10 @@ protected:
     }
     // Every device done writing and holding exactly the server's objects,
     // all PERSISTED.
-    bool converged() {
-        if (changesLogged() == 0) return false;
-        std::vector<std::string> expected = ServerFile(dir.file("server.db")).objectRows();
-        expected.insert(expected.begin(), "done");
-        for (const std::string& tag : tags) {
-            if (deviceRows(tag) != expected) return false;
-        }
-        return true;
-    }
+    bool converged() { return changesLogged() != 0 && devices.allHold(ServerFile(dir.file("server.db")).objectRows()); }
     // What each device and the server hold, for failure messages.
     std::string describe() {
-        std::string text;
-        for (const std::string& tag : tags) {
-            text += "device " + tag + ":";
-            for (const std::string& row : deviceRows(tag)) text += " " + row;
-            text += "\n";
-        }
-        text += "server:";
+        std::string text = devices.describe() + "server:";
         for (const std::string& row : ServerFile(dir.file("server.db")).objectRows()) text += " " + row;
         text += "\nlog (sequence/version/key=blob):";
         for (const std::string& row : ServerFile(dir.file("server.db")).logRows()) text += " " + row;
@@ -141,41 +118,28 @@ protected:
         int64_t count = file.single("SELECT COUNT(*) FROM changes WHERE collection = ?", {kCollection});
         EXPECT_EQ(count,
                   file.single("SELECT IFNULL(MAX(sequence), 0) FROM changes WHERE collection = ?", {kCollection}));
-        for (const std::string& tag : tags) {
-            std::vector<std::string> persisted = testsupport::fileLines(dir.file(tag + ".state.persisted"));
-            EXPECT_FALSE(persisted.empty()) << tag;
-            for (const std::string& line : persisted) {
-                std::istringstream words(line);
-                std::string key, blob;
-                words >> key >> blob;
-                const char* sql = "SELECT COUNT(*) FROM changes WHERE primary_key = ? AND CAST(blob AS TEXT) = ?";
-                EXPECT_EQ(1, file.single(sql, {key, blob}))
-                    << tag << " was told PERSISTED: " << line;
-            }
-        }
-    }
-    void stopDevices() {
-        for (auto& device : devices) device->kill(SIGTERM);
-        for (auto& device : devices) {
-            int status = device->wait();
-            EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << testsupport::describeWaitStatus(status);
-        }
+        devices.forEachPersisted([&](const std::string& tag, const std::string& line) {
+            std::istringstream words(line);
+            std::string key, blob;
+            words >> key >> blob;
+            const char* sql = "SELECT COUNT(*) FROM changes WHERE primary_key = ? AND CAST(blob AS TEXT) = ?";
+            EXPECT_EQ(1, file.single(sql, {key, blob})) << tag << " was told PERSISTED: " << line;
+        });
     }
 
     TempDir dir;
     MqttBroker broker{dir};
-    std::vector<std::unique_ptr<ChildProcess>> devices;
-    std::vector<std::string> tags;
+    testsupport::DeviceProcesses devices{dir};
 };
 
 // Two stores write offline first (every change PENDING, status 1) and the
 // third while the server runs, so the server is killed while it takes both
 // resent queues and live changes.
 TEST_F(NetworkSyncTest, ThreeStoresConvergeThroughServerKilledMidStreamAndBrokerRestarted) {
-    startDevice("a", 40, 0);
-    startDevice("b", 40, 0);
+    devices.start("a", broker.port, 40, 0);
+    devices.start("b", broker.port, 40, 0);
     auto allPending = [&](const std::string& tag) {
-        std::vector<std::string> rows = deviceRows(tag);
+        std::vector<std::string> rows = devices.rows(tag);
         return !rows.empty() && std::all_of(rows.begin() + 1, rows.end(), [](const std::string& row) {
             return row.substr(row.size() - 2) == "#1";
         });
@@ -183,7 +147,7 @@ TEST_F(NetworkSyncTest, ThreeStoresConvergeThroughServerKilledMidStreamAndBroker
     ASSERT_TRUE(waitUntil([&] { return allPending("a") && allPending("b"); }));
     broker.start();
     auto server = startServer();
-    startDevice("c", 40, 25);
+    devices.start("c", broker.port, 40, 25);
 
     ASSERT_TRUE(waitUntil([&] { return changesLogged() >= 10; }));
     server->kill(SIGKILL);
@@ -197,7 +161,7 @@ TEST_F(NetworkSyncTest, ThreeStoresConvergeThroughServerKilledMidStreamAndBroker
 
     ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
     expectLogComplete();
-    stopDevices();
+    devices.stop();
     server->kill(SIGTERM);
     EXPECT_EQ(0, server->wait());
 }
@@ -209,7 +173,7 @@ protected:
     void startDevices(int writes, int pauseMs) {
         const char* const nodeTags[NatsCluster::kNodes] = {"a", "b", "c"};
         for (size_t node = 0; node < NatsCluster::kNodes; ++node) {
-            startDevice(nodeTags[node], writes, pauseMs, cluster.port(node));
+            devices.start(nodeTags[node], cluster.port(node), writes, pauseMs);
         }
     }
     // describe() and the end of each node's log.
@@ -224,17 +188,6 @@ protected:
     NatsCluster cluster{dir};
 };
 
-TEST_F(ClusteredBrokerTest, StoresOnDifferentNodesConvergeThroughOneServer) {
-    cluster.start();
-    auto server = startServer(cluster.port(0));
-    startDevices(12, 0);
-    ASSERT_TRUE(waitUntil([&] { return converged(); }, kClusterDeadline)) << describeCluster();
-    expectLogComplete();
-    stopDevices();
-    server->kill(SIGTERM);
-    EXPECT_EQ(0, server->wait());
-}
-
 TEST_F(ClusteredBrokerTest, NodeOfServerAndStoreKilledMidStreamLosesNoPersistedChange) {
     cluster.start();
     auto server = startServer(cluster.port(0));
@@ -244,7 +197,7 @@ TEST_F(ClusteredBrokerTest, NodeOfServerAndStoreKilledMidStreamLosesNoPersistedC
     cluster.start(0);
     ASSERT_TRUE(waitUntil([&] { return converged(); }, kClusterDeadline)) << describeCluster();
     expectLogComplete();
-    stopDevices();
+    devices.stop();
 }
 
 // NATS refuses some characters in topics and drops the connection that uses

@@ -6,7 +6,6 @@
 // cannot single out.
 #include <gtest/gtest.h>
 
-#include <fstream>
 #include <map>
 #include <memory>
 #include <sstream>
@@ -15,6 +14,7 @@
 #include <vector>
 
 #include "ChildProcess.h"
+#include "DeviceProcesses.h"
 #include "MqttBroker.h"
 #include "NatsCluster.h"
 #include "PostgresServer.h"
@@ -38,13 +38,6 @@ constexpr int kWrites = 60;
 constexpr int kPauseMs = 25;
 // Short leases, so that a takeover happens within the test's seconds.
 constexpr const char* kLeaseMs = "1500";
-
-std::vector<std::string> readLines(const std::string& path) {
-    std::vector<std::string> lines;
-    std::ifstream in(path);
-    for (std::string line; std::getline(in, line);) lines.push_back(line);
-    return lines;
-}
 
 class ServerTierTest : public ::testing::Test {
 protected:
@@ -73,14 +66,7 @@ protected:
     }
     // Store i on nodes[i].
     void startDevices(const std::vector<size_t>& nodes = {0, 1, 2}) {
-        for (const std::string tag : {"a", "b", "c"}) {
-            devices.push_back(std::make_unique<ChildProcess>(
-                TESSARINE_SYNC_DEVICE,
-                std::vector<std::string>{dir.file(tag + ".db"), std::to_string(port(nodes[tags.size()])), tag,
-                                         std::to_string(kWrites), std::to_string(kPauseMs), dir.file(tag + ".state")},
-                TESSARINE_TEST_EMULATOR));
-            tags.push_back(tag);
-        }
+        for (const std::string tag : {"a", "b", "c"}) devices.start(tag, port(nodes[devices.size()]), kWrites, kPauseMs);
     }
     // Streams until the serving instance is killed and another one took
     // over; then all converge with a complete log.
@@ -100,7 +86,7 @@ protected:
         EXPECT_EQ(1u, instances.count(successor)) << successor;
         ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
         expectLogComplete();
-        stopDevices();
+        devices.stop();
     }
     // The rows of a query, columns joined by "|"; empty while the database
     // is away.
@@ -140,23 +126,9 @@ protected:
         }
         return rows;
     }
-    bool converged() {
-        std::vector<std::string> expected = serverRows();
-        if (expected.empty()) return false;
-        expected.insert(expected.begin(), "done");
-        for (const std::string& tag : tags) {
-            if (readLines(dir.file(tag + ".state")) != expected) return false;
-        }
-        return true;
-    }
+    bool converged() { return devices.allHold(serverRows()); }
     std::string describe() {
-        std::string text;
-        for (const std::string& tag : tags) {
-            text += "device " + tag + ":";
-            for (const std::string& row : readLines(dir.file(tag + ".state"))) text += " " + row;
-            text += "\n";
-        }
-        text += "server:";
+        std::string text = devices.describe() + "server:";
         for (const std::string& row : serverRows()) text += " " + row;
         return text + "\nlog:\n" + logDump();
     }
@@ -188,11 +160,9 @@ protected:
         for (const std::string& row : query("SELECT primary_key || ' ' || convert_from(blob, 'UTF8') FROM tessarine_changes")) {
             ++logged[row];
         }
-        for (const std::string& tag : tags) {
-            std::vector<std::string> persisted = readLines(dir.file(tag + ".state.persisted"));
-            EXPECT_FALSE(persisted.empty()) << tag;
-            for (const std::string& line : persisted) EXPECT_EQ(1, logged[line]) << tag << " was told PERSISTED: " << line;
-        }
+        devices.forEachPersisted([&](const std::string& tag, const std::string& line) {
+            EXPECT_EQ(1, logged[line]) << tag << " was told PERSISTED: " << line;
+        });
     }
     std::string logDump() {
         std::string text;
@@ -203,13 +173,6 @@ protected:
         }
         return text;
     }
-    void stopDevices() {
-        for (auto& device : devices) device->kill(SIGTERM);
-        for (auto& device : devices) {
-            int status = device->wait();
-            EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << testsupport::describeWaitStatus(status);
-        }
-    }
 
     TempDir dir;
     testsupport::PostgresServer postgres;
@@ -217,8 +180,7 @@ protected:
     std::unique_ptr<testsupport::NatsCluster> cluster;
     std::unique_ptr<ts::server::PgConnection> reader;  // reconnects by itself after a restart
     std::map<std::string, std::unique_ptr<ChildProcess>> instances;
-    std::vector<std::unique_ptr<ChildProcess>> devices;
-    std::vector<std::string> tags;
+    testsupport::DeviceProcesses devices{dir};
 };
 
 TEST_F(ServerTierTest, ThreeStoresConvergeWhenTheServingInstanceIsKilledMidStream) {
@@ -246,7 +208,7 @@ TEST_F(ServerTierTest, StoresOnANatsClusterConvergeWhenTheServingInstancesNodeIs
     ASSERT_TRUE(waitUntil([&] { return !leaseHolder().empty() && leaseHolder() != "one"; }, kConvergeDeadline));
     ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
     expectLogComplete();
-    stopDevices();
+    devices.stop();
 }
 
 // A store's node dies while the instance serving it lives on: the store
@@ -260,7 +222,7 @@ TEST_F(ServerTierTest, StoresOnANatsClusterConvergeWhenAStoresNodeIsKilledMidStr
     cluster->start(0);
     ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
     expectLogComplete();
-    stopDevices();
+    devices.stop();
 }
 
 TEST_F(ServerTierTest, StoresConvergeWhenPostgresIsKilledMidStreamAndStartedAgain) {
@@ -275,7 +237,7 @@ TEST_F(ServerTierTest, StoresConvergeWhenPostgresIsKilledMidStreamAndStartedAgai
     ASSERT_TRUE(waitUntil([&] { return changesLogged() >= beforeRestart + 10; }, kConvergeDeadline));
     ASSERT_TRUE(waitUntil([&] { return converged(); }, kConvergeDeadline)) << describe();
     expectLogComplete();
-    stopDevices();
+    devices.stop();
     for (auto& instance : instances) {
         instance.second->kill(SIGTERM);
         EXPECT_EQ(0, instance.second->wait()) << instance.first;
