@@ -66,7 +66,9 @@ protected:
     }
     // Store i on nodes[i].
     void startDevices(const std::vector<size_t>& nodes = {0, 1, 2}) {
-        for (const std::string tag : {"a", "b", "c"}) devices.start(tag, port(nodes[devices.size()]), kWrites, kPauseMs);
+        for (const std::string tag : {"a", "b", "c"}) {
+            devices.start(tag, port(nodes[devices.size()]), kWrites, kPauseMs);
+        }
     }
     // Streams until the serving instance is killed and another one took
     // over; then all converge with a complete log.
